@@ -1,0 +1,76 @@
+// A log listener for tests: records every event of both channels while it
+// lives, so that tests can assert on what was logged.
+#pragma once
+
+#include <HGLog/HGLogger.h>
+
+#include <algorithm>
+#include <mutex>
+#include <string>
+#include <vector>
+
+namespace ictest {
+
+class LogCapture {
+public:
+    LogCapture()
+    {
+        HGLog::HGLogger::setListener([this](HGLog::Record const& r) {
+            std::lock_guard<std::mutex> g(m_);
+            records_.push_back(r);
+        });
+    }
+    ~LogCapture() { HGLog::HGLogger::setListener(HGLog::Listener()); }
+    LogCapture(LogCapture const&) = delete;
+    LogCapture& operator=(LogCapture const&) = delete;
+
+    std::vector<HGLog::Record> records() const
+    {
+        std::lock_guard<std::mutex> g(m_);
+        return records_;
+    }
+    // Events of the log channel only (every event is also on the trace one).
+    std::vector<HGLog::Record> logs() const
+    {
+        std::vector<HGLog::Record> out;
+        for (auto const& r : records())
+            if (r.channel == HGLog::Channel::Log)
+                out.push_back(r);
+        return out;
+    }
+    std::vector<std::string> messages() const
+    {
+        std::vector<std::string> out;
+        for (auto const& r : logs())
+            out.push_back(r.message);
+        return out;
+    }
+    // Number of log-channel events whose message equals text.
+    std::size_t count(std::string const& text) const
+    {
+        auto const m = messages();
+        return static_cast<std::size_t>(std::count(m.begin(), m.end(), text));
+    }
+    // The first log-channel event whose message equals text; null if none.
+    bool find(std::string const& text, HGLog::Record* out = nullptr) const
+    {
+        for (auto const& r : logs())
+            if (r.message == text) {
+                if (out)
+                    *out = r;
+                return true;
+            }
+        return false;
+    }
+    void clear()
+    {
+        std::lock_guard<std::mutex> g(m_);
+        records_.clear();
+    }
+
+private:
+    mutable std::mutex m_;
+    std::vector<HGLog::Record> records_;
+};
+
+} // namespace ictest
