@@ -2,6 +2,8 @@
 
 #include <HGLog/HGLogger.h>
 
+#include "../frame/HexText.h"
+
 #include <stdexcept>
 #include <utility>
 
@@ -396,14 +398,7 @@ std::string NodeStore::b12String(std::string s) const
 
 std::string NodeStore::hexstring(std::string const& s) const
 {
-    static char const hexval[] = "0123456789abcdef";
-    std::string out;
-    out.reserve(s.size() * 2);
-    for (unsigned char c : s) {
-        out += hexval[c >> 4];
-        out += hexval[c & 15];
-    }
-    return out;
+    return detail::hexText(s);
 }
 
 std::string NodeStore::stringhex(std::string const& s) const

@@ -1237,10 +1237,6 @@ TEST(NodeStoreConcurrency, ParallelAddsAndQueries)
     ASSERT_TRUE(addNew(store, sharedRoot));
     std::string const rootPath = refPath(TopoVec{{59, 0}});
     ASSERT_EQ(sharedRoot.getPath(), rootPath);
-    // Log once from this thread before the workers start: the log4cxx back
-    // end creates its level objects lazily, inside a library that the thread
-    // sanitizer does not instrument, and a first use from several threads at
-    // once is reported as a race in the logging layer.
     ASSERT_EQ(store.getNodeHierarchy(&sharedRoot), "ROOT:00000000");
 
     // Each writer owns a tree under a root of its own instance, built parent

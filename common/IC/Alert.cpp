@@ -1,5 +1,6 @@
 #include <IC/Alert.h>
 
+#include <ostream>
 #include <utility>
 
 namespace IC {
@@ -28,6 +29,11 @@ Alert::operator std::string() const
     out += "} message=";
     out += message_;
     return out;
+}
+
+std::ostream& operator<<(std::ostream& os, Alert const& alert)
+{
+    return os << static_cast<std::string>(alert);
 }
 
 } // namespace IC

@@ -12,6 +12,7 @@
 #include <SD/DateTime.h>
 
 #include <cstdint>
+#include <iosfwd>
 #include <string>
 #include <vector>
 
@@ -46,6 +47,9 @@ private:
     std::vector<std::string> nodePaths_;
     std::string message_;
 };
+
+// Writes the one-line rendering.
+ICCOMMON_API std::ostream& operator<<(std::ostream& os, Alert const& alert);
 
 // The callback through which alerts are delivered: the alerts and the context
 // given when registering. The library ignores its result.

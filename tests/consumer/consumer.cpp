@@ -3,6 +3,8 @@
 #include <HGLog/HGLogger.h>
 #include <HGLog/HGMessageBuffer.h>
 #include <IC/Alert.h>
+#include <IC/AlertRegister.h>
+#include <IC/AlertStore.h>
 #include <IC/Error.h>
 #include <IC/FunctionalPlugIn.h>
 #include <IC/ICforFP.h>
@@ -53,6 +55,12 @@ int main()
 
     IC::Alert alert(3, IC::Alert::NodeRemoval, {chassis.getPath()}, 2, "gone");
     check(alert.getClass() == 4, "alert class");
+
+    IC::AlertStore asserted;
+    asserted.newAlerts({alert}, IC::FP_ALERT);
+    std::vector<IC::Alert> out;
+    asserted.getAsserted(out);
+    check(out.size() == 1 && out[0].getMessage() == "gone", "alert store");
 
     SD::Mutex m;
     {
