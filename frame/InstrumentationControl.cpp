@@ -1,11 +1,17 @@
 #include <IC/InstCtrl.h>
 #include <IC/InstrumentationControl.h>
 
+#include <IC/FPControl.h>
+#include <IC/MIControl.h>
+#include <SD/PlatformUtilities.h>
+
 #include "HexText.h"
 #include "InstCtrlPrivate.h"
 
 #include <algorithm>
+#include <atomic>
 #include <memory>
+#include <mutex>
 #include <ostream>
 #include <set>
 
@@ -17,6 +23,11 @@ std::string loggerIC = "Helmgard.IC.InstrumentationControl";
 InstrumentationControl ic;
 Error myice(0, Number(0u), "");
 Error lderr(5, Number(1u), "Load Library");
+std::set<std::string> icbaselibpath;
+std::vector<libstruct> mymilibs;
+std::vector<libstruct> myfplibs;
+std::vector<ManagementInterface*> mymis;
+std::vector<FunctionalPlugIn*> myfps;
 Error donegood(0, Number(Number::Generic), "");
 std::map<CallbackKey, AlertRegister*, CallbackKeyLess> callbacks;
 std::multimap<std::string, AlertRegister*> nodepathTOalertregister;
@@ -24,8 +35,18 @@ std::multimap<Node::SensorType, AlertRegister*> sensortypeTOalertregister;
 std::multimap<Alert::ClassType, AlertRegister*> classtypeTOalertregister;
 std::vector<SimpleAlertRegister> mysam;
 NodeStore nodestore;
+std::uint32_t ICloadCount = 0;
+LoaderThread* lt = nullptr;
 AlertStore alertstore;
+SD::Mutex loadlock;
 SD::Mutex registerlock;
+bool unloaddone = false;
+std::uint16_t mymifpctr = 1;
+
+// Set while the last unload stops and joins the loader thread, which it does
+// holding loadlock: a reload that is waiting for loadlock then gives up
+// instead of waiting for the join that waits for it.
+std::atomic<bool> joiningLoaderThread{false};
 
 } // namespace InstCtrl
 
@@ -63,6 +84,15 @@ std::ostream& operator<<(std::ostream& os, PathList const& list)
     for (std::string const& path : list.paths)
         os << detail::hexText(path) << ' ';
     return os;
+}
+
+// One binary path in hexadecimal, rendered only when the line is written.
+struct HexPath {
+    std::string const& path;
+};
+std::ostream& operator<<(std::ostream& os, HexPath const& hex)
+{
+    return os << detail::hexText(hex.path);
 }
 
 // The keys a filter value puts into its index: the value itself, or each
@@ -159,6 +189,32 @@ void const* slotContext(unsigned int slot)
     return reinterpret_cast<void const*>(static_cast<std::uintptr_t>(slot));
 }
 
+// The plug-in part of an open or a reload; the results are the callers'.
+Error reloadManagementInterfaces()
+{
+    return MIControl().reLoadMIs(mymifpctr, mymilibs, mymis, AlertCallBackMI, myfps,
+                                 ic.getInterfaceVersion(), ic.getModuleVersion(), nodestore,
+                                 icbaselibpath, LoadCallBackMI, &ic, getNodeCallBackMI);
+}
+
+Error reloadFunctionalPlugIns()
+{
+    // Lives only for this pass: a plug-in copies what it keeps.
+    NodeAnnouncement const announce = MapNewFPNode;
+    ICforFP const services(mymis, regFPAlerts, deRegFPAlerts, AlertCallBackFP, AssertCallBackFP,
+                           ic.getInterfaceVersion(), ic.getModuleVersion(), announce, &ic,
+                           regFPsensorAlerts, deRegFPsensorAlerts);
+    AlertSink const raise = AlertCallBackFP;
+    return FPControl().reLoadFPs(mymifpctr, myfplibs, myfps, nodestore, services, raise,
+                                 icbaselibpath);
+}
+
+std::uint32_t openCount()
+{
+    SD::MutexGuard guard(loadlock);
+    return ICloadCount;
+}
+
 } // namespace
 
 namespace InstCtrl {
@@ -174,6 +230,138 @@ void diagError(Error* error, std::string context)
 std::string hexstring(std::string s)
 {
     return detail::hexText(s);
+}
+
+// --------------------------------------------------------- open and reload
+
+unsigned char openLib(InstrumentationControl** control, Error** error, std::string basePath,
+                      std::string logDir)
+{
+    char const separator = SD::PlatformUtilities::getSeparator();
+    unsigned char code = 0;
+    {
+        SD::MutexGuard guard(loadlock);
+        ++ICloadCount;
+        if (!basePath.empty()) {
+            if (basePath.back() != separator)
+                basePath += separator;
+            icbaselibpath.insert(basePath);
+        }
+        if (ICloadCount == 1) {
+            // First open: start from nothing. The pointers are dropped, not
+            // deleted: the last unload has ended their objects.
+            mymilibs.clear();
+            myfplibs.clear();
+            mymis.clear();
+            myfps.clear();
+            {
+                SD::MutexGuard registrations(registerlock);
+                callbacks.clear();
+                nodepathTOalertregister.clear();
+                sensortypeTOalertregister.clear();
+                classtypeTOalertregister.clear();
+                mysam.clear();
+            }
+            nodestore.clear();
+            alertstore.clear();
+            unloaddone = false;
+            // The logging library finds its own configuration; the path of
+            // the one in the log directory is worked out and not used.
+            std::string logConfig = logDir;
+            if (logConfig.empty() || logConfig.back() != separator)
+                logConfig += separator;
+            logConfig += "log4cxx.properties";
+            (void)logConfig;
+
+            IC_LOG(3000, "InstrumentationControl: entry Open count=", ICloadCount);
+            if (reloadManagementInterfaces().getStatus() != 0) {
+                code = 15;
+            } else if (reloadFunctionalPlugIns().getStatus() != 0) {
+                code = 31;
+            }
+            if (code != 0 && error)
+                *error = &lderr;
+        }
+    }
+    if (code == 0) {
+        if (control)
+            *control = &ic;
+        if (error)
+            *error = &myice;
+    } else {
+        // A failed first open undoes itself and takes its count back.
+        ic.doUnload();
+    }
+    IC_LOG(3000, "InstrumentationControl: Open count=", openCount(), " exit code=",
+           static_cast<unsigned int>(code));
+    return code;
+}
+
+void TimedReload()
+{
+    IC_LOG(3000, "Instrumentation Control Timed Reload");
+    std::unique_lock<SD::Mutex> guard(loadlock, std::defer_lock);
+    while (!guard.owns_lock()) {
+        if (loadlock.lock(50) == 0)
+            guard = std::unique_lock<SD::Mutex>(loadlock, std::adopt_lock);
+        else if (joiningLoaderThread.load())
+            return; // the unload has begun; nothing is left to reload
+    }
+    if (unloaddone || ICloadCount == 0)
+        return;
+    // Failures are logged by the reloads themselves.
+    reloadManagementInterfaces();
+    reloadFunctionalPlugIns();
+}
+
+// ---------------------------------------------------- node entries for plug-ins
+
+Error getNodeCallBackMI(std::string const& path, Node** node)
+{
+    IC_LOG(3000, "getNodeCallBack:");
+    Error result = nodestore.getNode(path, node);
+    if (result.getStatus() != 0)
+        diagError(&result, "getNodeCallBackMI: failure");
+    return result;
+}
+
+Error MapNewFPNode(Node* const& node)
+{
+    return nodestore.addNode(node);
+}
+
+Error LoadCallBackMI(Node* const& node, void const* context)
+{
+    if (!node) {
+        IC_LOG(6000, "LoadCallBackMI: null node ignored");
+        return failure();
+    }
+    IC_LOG(3000, "LoadCallBack: NodePtr=", node, " desc=", node->getDescription(), " index=",
+           node->getInstance());
+    Error result = nodestore.addMINode(std::vector<Node*>{node});
+    if (result.getStatus() == 6) {
+        IC_LOG(3000, "LoadCallBack: NodeStore:addMINode duplicate Node =", node->getDescription(),
+               " index=", node->getInstance());
+        return result;
+    }
+    if (result.getStatus() != 0) {
+        IC_LOG(3000, "LoadCallBackMI: NodeStore::addMINode failed. Node=", node->getDescription(),
+               " index=", node->getInstance(), " Error= ", result);
+        return result;
+    }
+    std::string const path = node->getPath();
+    if (path.empty()) {
+        IC_LOG(6000, "LoadCallBackMI: Node ", node, " path is empty: '", path, "'.");
+        return result;
+    }
+    Alert const arrival(0, Alert::NodeArrival, std::vector<std::string>{path}, 1,
+                        node->getDescription());
+    result = AlertCallBackMI(std::vector<Alert>{arrival}, context);
+    if (result.getStatus() == 0)
+        IC_LOG(3000, "LoadCallbackMI: sent alert= ", arrival);
+    else
+        diagError(&result, "LoadCallBackMI: failure");
+    return result;
 }
 
 // ------------------------------------------------------------------ dispatch
@@ -445,4 +633,143 @@ Error InstrumentationControl::getAssertedAlerts(std::vector<Alert>& alerts) cons
     return alertstore.getAsserted(alerts);
 }
 
+Error InstrumentationControl::getNode(unsigned int nodeId, Node** node) const
+{
+    IC_LOG(3000, "getNode: nodeId ", nodeId);
+    return nodestore.getNode(nodeId, node);
+}
+
+Error InstrumentationControl::getNode(std::string path, Node** node) const
+{
+    IC_LOG(3000, "getNode: path ", HexPath{path});
+    return nodestore.getNode(std::move(path), node);
+}
+
+Error InstrumentationControl::getMap(std::vector<Node*>& nodes) const
+{
+    IC_LOG(3000, "getMap: all");
+    return nodestore.getMap(nodes);
+}
+
+Error InstrumentationControl::getMap(std::vector<Node*>& nodes, unsigned int sensor) const
+{
+    IC_LOG(3000, "getMap: sensor ", sensor);
+    return nodestore.getMap(nodes, sensor);
+}
+
+std::string InstrumentationControl::getNodeHierarchy(Node* node, Node::SensorType sensor) const
+{
+    IC_LOG(3000, "getNodeHierarchy: parent sensor ", sensor);
+    return nodestore.getNodeHierarchy(node, sensor);
+}
+
+std::string InstrumentationControl::getNodeHierarchy(Node* node) const
+{
+    IC_LOG(3000, "getNodeHierarchy: ");
+    return nodestore.getNodeHierarchy(node);
+}
+
+std::string InstrumentationControl::getNodeUniqueId(Node* node) const
+{
+    IC_LOG(3000, "getNodeUniqueId:");
+    return nodestore.getNodePath(node);
+}
+
+std::string InstrumentationControl::pathToPrintablePath(std::string const& path) const
+{
+    IC_LOG(3000, "pathToPrintablePath: ", HexPath{path});
+    return nodestore.hexstring(path);
+}
+
+std::string InstrumentationControl::printablePathToPath(std::string const& printable) const
+{
+    IC_LOG(3000, "printabePathToPath: ", printable);
+    return nodestore.stringhex(printable);
+}
+
+void InstrumentationControl::doUnload()
+{
+    SD::MutexGuard guard(loadlock);
+    if (unloaddone)
+        return;
+    // An unload without a matching open tears down whatever there is.
+    if (ICloadCount != 0 && --ICloadCount != 0)
+        return;
+    unloaddone = true;
+
+    // The loader thread goes first, before anything it might use.
+    if (lt) {
+        struct JoinFlag {
+            JoinFlag() { joiningLoaderThread = true; }
+            ~JoinFlag() { joiningLoaderThread = false; }
+        } joining;
+        lt->stop();
+        IC_LOG(3000, "doUnload: waiting for LoaderThread Termination ");
+        lt->join();
+        IC_LOG(3000, "doUnload: LoaderThread ended ");
+        delete lt;
+    }
+    lt = nullptr;
+
+    // Functional plug-ins use the management interfaces, so they end first;
+    // each group's objects end before their code is unmapped.
+    while (!myfps.empty()) {
+        myfps.back()->release();
+        myfps.pop_back();
+    }
+    while (!myfplibs.empty()) {
+        SD::PlatformUtilities::unloadLibrary(myfplibs.back().handle);
+        myfplibs.pop_back();
+    }
+    while (!mymis.empty()) {
+        ManagementInterface* const mi = mymis.back();
+        mi->shutdown();
+        mi->release();
+        mymis.pop_back();
+    }
+    while (!mymilibs.empty()) {
+        SD::PlatformUtilities::unloadLibrary(mymilibs.back().handle);
+        mymilibs.pop_back();
+    }
+    {
+        SD::MutexGuard registrations(registerlock);
+        for (auto const& entry : callbacks)
+            delete entry.second;
+        callbacks.clear();
+        nodepathTOalertregister.clear();
+        sensortypeTOalertregister.clear();
+        classtypeTOalertregister.clear();
+    }
+    IC_LOG(3000, "InstrumentationControl unload done");
+}
+
 } // namespace IC
+
+// ------------------------------------------------------------- entry points
+
+extern "C" {
+
+unsigned char Open(IC::InstrumentationControl** control, IC::Error** error)
+{
+    return Openlib(control, error, std::string());
+}
+
+unsigned char Openlib(IC::InstrumentationControl** control, IC::Error** error,
+                      std::string basePath)
+{
+    return IC::InstCtrl::openLib(control, error, std::move(basePath),
+                                 SD::PlatformUtilities::getBriscaDataDir());
+}
+
+unsigned char Openliblog(IC::InstrumentationControl** control, IC::Error** error,
+                         std::string basePath, std::string logDir)
+{
+    return IC::InstCtrl::openLib(control, error, std::move(basePath), std::move(logDir));
+}
+
+void Unloadlib()
+{
+    IC::InstCtrl::ic.doUnload();
+}
+
+} // extern "C"

@@ -77,6 +77,9 @@ Error NodeStore::addNode(std::vector<Node*> const& nodes)
 
 Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
 {
+    isNew = false;
+    if (!node)
+        return status(1);
     SD::MutexGuard guard(storeLock);
     Node* existing = nullptr;
     Error result = nodePath2Node(calcPathFromLinkedId(node), &existing);
@@ -98,7 +101,9 @@ Error NodeStore::addMINode(std::vector<Node*> const& nodes)
     Error result = status(0);
     for (Node* node : nodes) {
         Node* existing = nullptr;
-        if (nodePath2Node(calcPathFromLinkedId(node), &existing).getStatus() != 0)
+        if (!node)
+            result = status(1);
+        else if (nodePath2Node(calcPathFromLinkedId(node), &existing).getStatus() != 0)
             result = add2NodeMap(node);
         else
             result = status(6);
@@ -189,6 +194,9 @@ void NodeStore::delNodeFromGetMap(std::string const& path)
 
 void NodeStore::clear()
 {
+    // Callers need not hold the lock; taking it costs nothing when they do
+    // and keeps a first open safe against a client still querying.
+    SD::MutexGuard guard(storeLock);
     nodePathMap.clear();
     nodeIdPathMap.clear();
     nodeIdMap.clear();

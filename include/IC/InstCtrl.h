@@ -1,7 +1,8 @@
 // The library's exported global state and the functions of namespace
 // IC::InstCtrl that it hands to plug-ins and hosts.
 //
-// Locks: registerlock guards the four registration indexes, the registers
+// Locks: loadlock serialises open, unload and reload, and guards the plug-in
+// lists, the open count and the flags; registerlock guards the four registration indexes, the registers
 // and mysam; the node store and the alert store guard themselves. Take
 // registerlock before the node store's lock, never the other way round.
 #pragma once
@@ -11,6 +12,10 @@
 #include <IC/AlertStore.h>
 #include <IC/Error.h>
 #include <IC/Export.h>
+#include <IC/FunctionalPlugIn.h>
+#include <IC/LoadControl.h>
+#include <IC/LoaderThread.h>
+#include <IC/ManagementInterface.h>
 #include <IC/Node.h>
 #include <IC/NodeStore.h>
 #include <SD/Mutex.h>
@@ -18,6 +23,7 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <set>
 #include <string>
 #include <utility>
 #include <vector>
@@ -41,6 +47,13 @@ struct CallbackKeyLess {
 };
 
 // ---- global state ----
+// Base library paths given by clients, each ending with a separator.
+IC_API extern std::set<std::string> icbaselibpath;
+// Loaded plug-in libraries and objects, in load order.
+IC_API extern std::vector<libstruct> mymilibs;
+IC_API extern std::vector<libstruct> myfplibs;
+IC_API extern std::vector<ManagementInterface*> mymis;
+IC_API extern std::vector<FunctionalPlugIn*> myfps;
 // The shared success value of the alert functions.
 IC_API extern Error donegood;
 // Every register, by (callback, context); owns the registers.
@@ -53,16 +66,43 @@ IC_API extern std::multimap<Alert::ClassType, AlertRegister*> classtypeTOalertre
 IC_API extern std::vector<SimpleAlertRegister> mysam;
 // The node registry.
 IC_API extern NodeStore nodestore;
+// Number of opens not yet matched by an unload.
+IC_API extern std::uint32_t ICloadCount;
+// The host's loader thread, if any; the last unload stops and deletes it.
+IC_API extern LoaderThread* lt;
 // The alerts currently asserted.
 IC_API extern AlertStore alertstore;
+// Serialises open, unload and reload.
+IC_API extern SD::Mutex loadlock;
 // Serialises registration and dispatch.
 IC_API extern SD::Mutex registerlock;
+// Set by the unload that tore the state down; cleared by the next first open.
+IC_API extern bool unloaddone;
+// Load number of the next plug-in; never reset.
+IC_API extern std::uint16_t mymifpctr;
+
+// ---- open and reload ----
+// The open sequence behind the entry points; returns the load code (0, 15
+// management interfaces failed, 31 functional plug-ins failed).
+IC_API unsigned char openLib(InstrumentationControl** control, Error** error,
+                             std::string basePath, std::string logDir);
+// One reload pass of both plug-in directories; the function for a
+// LoaderThread.
+IC_API void TimedReload();
 
 // ---- diagnostics ----
 // Logs "<context>: <error text>" as an error on the library's logger.
 IC_API void diagError(Error* error, std::string context);
 // Lower-case hexadecimal of a binary path, for logs.
 IC_API std::string hexstring(std::string s);
+
+// ---- node entries handed to plug-ins ----
+// A management interface's node found after loading.
+IC_API Error LoadCallBackMI(Node* const& node, void const* context);
+// Node look-up by binary path for management interfaces.
+IC_API Error getNodeCallBackMI(std::string const& path, Node** node);
+// A functional plug-in's own node.
+IC_API Error MapNewFPNode(Node* const& node);
 
 // ---- alert entry points handed to plug-ins ----
 // A management interface's batch: reaches functional plug-in registrations.

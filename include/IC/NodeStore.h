@@ -40,7 +40,7 @@ public:
     // addNodeIfNew for each node; the result is always success.
     Error addNode(std::vector<Node*> const& nodes);
     // Registers the node, also for getMap, unless a node holds its path
-    // (then success with isNew false).
+    // (then success with isNew false). Status 1 for a null node.
     Error addNodeIfNew(Node* const& node, bool& isNew);
     // Registers nodes of management interfaces (not listed by getMap); the
     // result is that of the last node, status 6 when its path was taken.
@@ -58,7 +58,7 @@ public:
     void erase(std::string path);
     // Removes the node registered under path from getMap only.
     void delNodeFromGetMap(std::string const& path);
-    // Caller holds the lock (or no other thread can reach the store).
+    // Empties every index.
     void clear();
 
     Error getNode(unsigned int id, Node** node) const;
