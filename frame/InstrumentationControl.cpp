@@ -657,6 +657,12 @@ Error InstrumentationControl::getMap(std::vector<Node*>& nodes, unsigned int sen
     return nodestore.getMap(nodes, sensor);
 }
 
+Error InstrumentationControl::getAllNodes(std::vector<Node*>& nodes) const
+{
+    IC_LOG(3000, "getAllNodes:");
+    return nodestore.getAllNodes(nodes);
+}
+
 std::string InstrumentationControl::getNodeHierarchy(Node* node, Node::SensorType sensor) const
 {
     IC_LOG(3000, "getNodeHierarchy: parent sensor ", sensor);

@@ -253,6 +253,16 @@ Error NodeStore::getMap(std::vector<Node*>& nodes, unsigned int sensor) const
     return status(0);
 }
 
+Error NodeStore::getAllNodes(std::vector<Node*>& nodes) const
+{
+    SD::MutexGuard guard(storeLock);
+    nodes.clear();
+    nodes.reserve(nodeIdMap.size());
+    for (auto const& entry : nodeIdMap)
+        nodes.push_back(entry.second);
+    return status(0);
+}
+
 // ------------------------------------------------------ paths and hierarchy
 
 std::string NodeStore::calcNodePath(Node* node)

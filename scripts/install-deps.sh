@@ -7,6 +7,7 @@ packages=(
   build-essential cmake pkg-config binutils
   libgtest-dev libgmock-dev
   liblog4cxx-dev
+  libcli11-dev nlohmann-json3-dev
 )
 
 missing=()

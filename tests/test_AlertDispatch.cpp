@@ -724,12 +724,12 @@ TEST_F(Registration, TwoContextsGiveTwoRegisters)
     EXPECT_EQ(entries(ICC::sensortypeTOalertregister, ST::CPU, r1), 1u);
     EXPECT_EQ(entries(ICC::sensortypeTOalertregister, ST::CPU, r2), 1u);
 
-    // Removing one register's entries leaves the other's in place.
-    ICC::deRegisterForAlerts(recA, Paths{P0}, &c1);
-    ic.deRegisterForAlerts(recA, ST::CPU, &c1);
-    EXPECT_EQ(registerOf(recA, &c1), nullptr);
-    EXPECT_EQ(entries(ICC::sensortypeTOalertregister, ST::CPU, r2), 1u);
-    EXPECT_EQ(entries(ICC::nodepathTOalertregister, P0, r2), 1u);
+    // Removing the later register's entries leaves the earlier one's in place.
+    ICC::deRegisterForAlerts(recA, Paths{P0}, &c2);
+    ic.deRegisterForAlerts(recA, ST::CPU, &c2);
+    EXPECT_EQ(registerOf(recA, &c2), nullptr);
+    EXPECT_EQ(entries(ICC::sensortypeTOalertregister, ST::CPU, r1), 1u);
+    EXPECT_EQ(entries(ICC::nodepathTOalertregister, P0, r1), 1u);
     EXPECT_EQ(ICC::sensortypeTOalertregister.size(), 1u);
     EXPECT_EQ(ICC::nodepathTOalertregister.size(), 1u);
 }

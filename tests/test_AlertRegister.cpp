@@ -240,19 +240,6 @@ TEST(AlertRegisterDel, SensorAndClassRemovalReportWhetherAnythingIsLeft)
     EXPECT_TRUE(cap.records().empty()) << "successful removals log nothing";
 }
 
-TEST(AlertRegisterDel, ClassFilterSurvivesRemovalOfTheSensorAndViceVersa)
-{
-    AlertRegister a(recordA, &gCtx1, 1), b(recordA, &gCtx1, 1);
-    for (AlertRegister* r : {&a, &b}) {
-        r->add(recordA, ST::CPU);
-        r->add(recordA, cls(9));
-    }
-    EXPECT_EQ(a.del(recordA, ST::CPU), 0);
-    EXPECT_EQ(a.getClasses().size(), 1u);
-    EXPECT_EQ(b.del(recordA, cls(9)), 0);
-    EXPECT_EQ(b.getSensorTypes().size(), 1u);
-}
-
 TEST(AlertRegisterDel, RemovingAnUnregisteredValueIsNotAnError)
 {
     AlertRegister r(recordA, &gCtx1, 1);
@@ -586,17 +573,4 @@ TEST_F(AlertCallTest, CallWithoutAlertsStillCallsBackAndClearsNothing)
     std::vector<Alert> stored;
     local.getAsserted(stored);
     EXPECT_EQ(stored.size(), 1u);
-}
-
-TEST_F(AlertCallTest, ClearingAlertRemovesTheStoredEntryBeforeDelivery)
-{
-    IC::AlertStore local;
-    local.newAlerts({alert(0, {P0}, 2)}, kFP);
-    gWatched = &local;
-    AlertCall call(recordA, nullptr);
-    Paths a{P0};
-    call.add(alert(0, {P0}, 1, "normal"), a);
-    call.callBack(local, kFP);
-    ASSERT_EQ(gDeliveries.size(), 1u);
-    EXPECT_EQ(gDeliveries[0].storedAtCall, 0u);
 }

@@ -115,12 +115,6 @@ TEST_F(AlertStoreTest, ManagementInterfaceBatchLeavesStoreAlone)
     EXPECT_TRUE(cap.records().empty()) << "an ignored batch logs nothing";
 }
 
-TEST_F(AlertStoreTest, OtherTypesAreIgnoredLikeManagementInterfaces)
-{
-    store.newAlerts({alert({A}, 2)}, 7);
-    EXPECT_TRUE(asserted(store).empty());
-}
-
 TEST_F(AlertStoreTest, NormalStatusClearsOnePathOfATwoPathAlert)
 {
     Alert const first = alert({A, B}, 2, "first");

@@ -467,6 +467,38 @@ TEST_F(NodeStoreRegistry, GetMapOrdersByTypeThenInsertion)
     EXPECT_EQ(allOf(store, ST::ROOT), std::vector<Node*>{&root});
 }
 
+TEST_F(NodeStoreRegistry, GetAllNodesListsManagementInterfaceNodesToo)
+{
+    Node root(ST::ROOT, 0, 0x10001, 0, "root");
+    Node fan(ST::Fan, 2, 0x10003, 0x10001, "fan");
+    Node fpNode(ST::Group, 0, 0x20001, 0x10001, "group");
+    ASSERT_EQ(store.addMINode({&root}).getStatus(), 0);
+    ASSERT_EQ(store.addMINode({&fan}).getStatus(), 0);
+    EXPECT_TRUE(addNew(store, fpNode));
+    Node stray(ST::CPU, 1, 99, 0, "stray");
+    std::vector<Node*> v{&stray};
+    expectDone(store.getAllNodes(v), 0);
+    EXPECT_EQ(v, (std::vector<Node*>{&root, &fan, &fpNode}));
+    expectDone(store.getMap(v), 0);
+    EXPECT_EQ(v, std::vector<Node*>{&fpNode});
+
+    // A removed node leaves the listing with its indexes.
+    store.erase(fan.getPath());
+    expectDone(store.getAllNodes(v), 0);
+    EXPECT_EQ(v, (std::vector<Node*>{&root, &fpNode}));
+}
+
+TEST_F(NodeStoreRegistry, NullNodesAreRefused)
+{
+    bool isNew = true;
+    EXPECT_EQ(store.addNodeIfNew(nullptr, isNew).getStatus(), 1);
+    EXPECT_FALSE(isNew);
+    EXPECT_EQ(store.addMINode({nullptr}).getStatus(), 1);
+    std::vector<Node*> v;
+    store.getAllNodes(v);
+    EXPECT_TRUE(v.empty());
+}
+
 TEST_F(NodeStoreRegistry, GetMapOfUnknownTypeIsEmpty)
 {
     Node root(ST::ROOT, 0, 1, 0, "root");

@@ -46,6 +46,10 @@ public:
     // type; or those of one sensor type.
     Error getMap(std::vector<Node*>& nodes) const;
     Error getMap(std::vector<Node*>& nodes, unsigned int sensor) const;
+    // nodes := every registered node, those of the management interfaces
+    // included (getMap lists only nodes of functional plug-ins and reloads),
+    // by ascending node id. For tools that show the whole hardware tree.
+    Error getAllNodes(std::vector<Node*>& nodes) const;
     // "ROOT:00000000->Chassis:00000000->CPU:00000001", from the nearest
     // ancestor of type sensor (or the root) down to the node.
     std::string getNodeHierarchy(Node* node, Node::SensorType sensor) const;

@@ -71,6 +71,9 @@ public:
     Error getMap(std::vector<Node*>& nodes) const;
     // nodes := those of one sensor type, in order of addition.
     Error getMap(std::vector<Node*>& nodes, unsigned int sensor) const;
+    // nodes := every registered node, management interfaces' included, by
+    // ascending node id.
+    Error getAllNodes(std::vector<Node*>& nodes) const;
 
     // ---- paths and hierarchy ----
     // Caller holds the lock. The node's path; caches it and the paths of
