@@ -5,6 +5,8 @@
 
 #include <HGLog/HGLogger.h>
 
+#include <algorithm>
+
 #include "../frame/HexText.h"
 
 namespace IC {
@@ -17,6 +19,32 @@ std::string loggerAlertRegister = "Helmgard.IC.InstrumentationControl.AlertRegis
 
 #define AR_LOG(level, ...) \
     HGLOG_EVENT("AlertRegister", ALERT_REGISTER::loggerAlertRegister, level, __VA_ARGS__)
+
+// ----------------------------------------------------------------- AlertBatch
+
+AlertBatch::AlertBatch(NodeStore& store, std::vector<Alert> const& alerts)
+{
+    sensors.resize(alerts.size());
+    for (std::size_t a = 0; a < alerts.size(); ++a) {
+        auto const& nodePaths = alerts[a].nodePaths();
+        sensors[a].reserve(nodePaths.size());
+        for (std::string const& path : nodePaths) {
+            auto& naming = byPath[path];
+            if (naming.empty() || naming.back() != a)
+                naming.push_back(a);
+            Node::SensorType const sensor = store.nodePathToSensor(path);
+            if (sensor == Node::invalid)
+                unknownPath = true;
+            sensors[a].push_back(sensor);
+        }
+    }
+}
+
+std::vector<std::size_t> const* AlertBatch::alertsNaming(std::string const& path) const
+{
+    auto it = byPath.find(path);
+    return it == byPath.end() ? nullptr : &it->second;
+}
 
 // ------------------------------------------------------------------ AlertCall
 
@@ -140,24 +168,66 @@ bool AlertRegister::filterAlerts(NodeStore& store, std::vector<Alert> const& ale
     // Clients see only what functional plug-ins raise.
     if (regType == CLIENT_REGISTRATION && type == MI_ALERT)
         return false;
+    return filterAlerts(AlertBatch(store, alerts), alerts, calls, type);
+}
+
+bool AlertRegister::filterAlerts(AlertBatch const& batch, std::vector<Alert> const& alerts,
+                                 std::vector<AlertCall>& calls, unsigned int type)
+{
+    // Clients see only what functional plug-ins raise.
+    if (regType == CLIENT_REGISTRATION && type == MI_ALERT)
+        return false;
     if (!callback) {
         AR_LOG(6000, "filterAlerts: Alert Register has null callback address");
         return false;
     }
     AlertCall call(callback, context);
     std::vector<std::string> matched;
-    for (Alert const& alert : alerts) {
+
+    // A register that filters by path alone can only take alerts that name
+    // one of its paths; the others it would pass over without a word unless
+    // their every alert is logged or a path is unknown.
+    bool const pathsOnly = classes.empty() && sensorTypes.empty() && !batch.hasUnknownPath() &&
+                           !HGLog::HGLogger::isEnabled(ALERT_REGISTER::loggerAlertRegister, 3000);
+    if (pathsOnly) {
+        std::vector<std::size_t> candidates;
+        if (nodePaths.size() <= batch.distinctPaths()) {
+            for (std::string const& path : nodePaths)
+                if (auto const* naming = batch.alertsNaming(path))
+                    candidates.insert(candidates.end(), naming->begin(), naming->end());
+        } else {
+            for (auto const& entry : batch.paths())
+                if (nodePaths.count(entry.first) != 0)
+                    candidates.insert(candidates.end(), entry.second.begin(), entry.second.end());
+        }
+        std::sort(candidates.begin(), candidates.end());
+        candidates.erase(std::unique(candidates.begin(), candidates.end()), candidates.end());
+        for (std::size_t a : candidates) {
+            matched.clear();
+            for (std::string const& path : alerts[a].nodePaths())
+                if (nodePaths.count(path) != 0)
+                    matched.push_back(path);
+            call.add(alerts[a], matched);
+        }
+        calls.push_back(std::move(call));
+        return false;
+    }
+
+    for (std::size_t a = 0; a < alerts.size(); ++a) {
+        Alert const& alert = alerts[a];
         AR_LOG(3000, "AlertRegister::filterAlerts Input Alert=", alert);
         matched.clear();
+        auto const& alertPaths = alert.nodePaths();
         if (classes.count(alert.getClass()) != 0) {
-            matched = alert.nodePaths();
+            matched = alertPaths;
         } else {
-            for (std::string const& path : alert.nodePaths()) {
+            for (std::size_t p = 0; p < alertPaths.size(); ++p) {
+                std::string const& path = alertPaths[p];
                 if (nodePaths.count(path) != 0) {
                     matched.push_back(path);
                     continue;
                 }
-                Node::SensorType const sensor = store.nodePathToSensor(path);
+                Node::SensorType const sensor = batch.sensorOf(a, p);
                 if (sensor == Node::invalid) {
                     AR_LOG(6000, "filterAlerts: could not find nodepath for NodePath=",
                            hexstring(path), " Sensor Class=", static_cast<unsigned int>(sensor));

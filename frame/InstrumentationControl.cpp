@@ -388,16 +388,21 @@ Error AlertCallBackCommon(std::vector<Alert> const& alerts, void const*, MyAlert
     std::vector<AlertCall> calls;
     {
         SD::MutexGuard guard(registerlock);
+        // Each path's sensor type is looked up once for the whole batch.
+        AlertBatch const batch(nodestore, alerts);
         std::set<AlertRegister*> selected;
-        for (Alert const& alert : alerts) {
+        for (std::size_t a = 0; a < alerts.size(); ++a) {
+            Alert const& alert = alerts[a];
             auto byClass = classtypeTOalertregister.equal_range(alert.getClass());
             for (auto it = byClass.first; it != byClass.second; ++it)
                 selected.insert(it->second);
-            for (std::string const& path : alert.nodePaths()) {
+            auto const& paths = alert.nodePaths();
+            for (std::size_t p = 0; p < paths.size(); ++p) {
+                std::string const& path = paths[p];
                 if (alert.getClass() == Alert::NodeRemoval &&
                     std::find(removed.begin(), removed.end(), path) == removed.end())
                     removed.push_back(path);
-                auto bySensor = sensortypeTOalertregister.equal_range(nodestore.nodePathToSensor(path));
+                auto bySensor = sensortypeTOalertregister.equal_range(batch.sensorOf(a, p));
                 for (auto it = bySensor.first; it != bySensor.second; ++it)
                     selected.insert(it->second);
                 auto byPath = nodepathTOalertregister.equal_range(path);
@@ -405,8 +410,9 @@ Error AlertCallBackCommon(std::vector<Alert> const& alerts, void const*, MyAlert
                     selected.insert(it->second);
             }
         }
+        calls.reserve(selected.size());
         for (AlertRegister* reg : selected)
-            if (reg->filterAlerts(nodestore, alerts, calls, type))
+            if (reg->filterAlerts(batch, alerts, calls, type))
                 IC_LOG(3000, "InstrumentationControl ER_CLEANED from AlertRegister ", reg);
     }
     // Callbacks run without the lock, so that they may register and

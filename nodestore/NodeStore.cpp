@@ -4,6 +4,7 @@
 
 #include "../frame/HexText.h"
 
+#include <algorithm>
 #include <stdexcept>
 #include <utility>
 
@@ -56,6 +57,34 @@ NodeStore::~NodeStore()
     clear();
 }
 
+// ------------------------------------------------------------ index helpers
+
+Node* NodeStore::registeredNode(unsigned int id) const
+{
+    auto it = idMap.find(id);
+    return it == idMap.end() ? nullptr : it->second.node;
+}
+
+std::string const* NodeStore::cachedPath(unsigned int id) const
+{
+    auto it = idMap.find(id);
+    return it == idMap.end() || it->second.path.empty() ? nullptr : &it->second.path;
+}
+
+void NodeStore::unlist(Node* node)
+{
+    auto type = sensorMap.find(static_cast<Node::SensorType>(*node));
+    if (type == sensorMap.end())
+        return;
+    auto& listed = type->second;
+    auto it = std::find(listed.begin(), listed.end(), node);
+    if (it == listed.end())
+        return;
+    listed.erase(it);
+    if (listed.empty())
+        sensorMap.erase(type);
+}
+
 // ---------------------------------------------------------------- registry
 
 Error NodeStore::addNode(Node* const& node)
@@ -81,17 +110,16 @@ Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
     if (!node)
         return status(1);
     SD::MutexGuard guard(storeLock);
-    Node* existing = nullptr;
-    Error result = nodePath2Node(calcPathFromLinkedId(node), &existing);
-    if (result.getStatus() == 1) {
-        // Made before add2NodeMap and kept even if the id turns out taken.
-        sensorMap.emplace(static_cast<Node::SensorType>(*node), node);
-        result = add2NodeMap(node);
-        isNew = result.getStatus() == 0;
-    } else {
-        isNew = false;
-        result = status(0);
-    }
+    // The path is computed once: registering caches what this walk found,
+    // exactly as computing it again would.
+    std::vector<PendingPath> pending;
+    std::string const path = walkPath(node, &pending);
+    if (nodePathMap.count(path) != 0)
+        return status(0);
+    // Listed before the id is entered, and kept even if the id is taken.
+    sensorMap[static_cast<Node::SensorType>(*node)].push_back(node);
+    Error result = add2NodeMapWalked(node, path, pending);
+    isNew = result.getStatus() == 0;
     return result;
 }
 
@@ -99,12 +127,16 @@ Error NodeStore::addMINode(std::vector<Node*> const& nodes)
 {
     SD::MutexGuard guard(storeLock);
     Error result = status(0);
+    std::vector<PendingPath> pending;
     for (Node* node : nodes) {
-        Node* existing = nullptr;
-        if (!node)
+        if (!node) {
             result = status(1);
-        else if (nodePath2Node(calcPathFromLinkedId(node), &existing).getStatus() != 0)
-            result = add2NodeMap(node);
+            continue;
+        }
+        pending.clear();
+        std::string const path = walkPath(node, &pending);
+        if (nodePathMap.count(path) == 0)
+            result = add2NodeMapWalked(node, path, pending);
         else
             result = status(6);
     }
@@ -113,10 +145,22 @@ Error NodeStore::addMINode(std::vector<Node*> const& nodes)
 
 Error NodeStore::add2NodeMap(Node* const& node)
 {
-    unsigned int const id = node->getNodeId();
-    bool const inserted = nodeIdMap.emplace(id, node).second;
+    std::vector<PendingPath> pending;
+    std::string const path = walkPath(node, &pending);
+    return add2NodeMapWalked(node, path, pending);
+}
 
-    node->setPath(calcNodePath(node));
+Error NodeStore::add2NodeMapWalked(Node* node, std::string const& path,
+                                   std::vector<PendingPath> const& pending)
+{
+    unsigned int const id = node->getNodeId();
+    IdEntry& entry = idMap[id];
+    bool const inserted = entry.node == nullptr;
+    if (inserted)
+        entry.node = node;
+
+    cachePaths(pending);
+    node->setPath(path);
 
     // A node without a parent (ROOT, OsHw, OsSw and IPMI are the expected
     // ones) simply gets an empty linked path.
@@ -129,7 +173,9 @@ Error NodeStore::add2NodeMap(Node* const& node)
 
     if (inserted)
         return status(0);
-    NS_LOG(6000, "add2NodeMap: Node ", id, " found twice during NodeId to Node Map");
+    // Reported as add2NodeMap's own, which this is the second half of.
+    HGLog::logEvent("add2NodeMap", "NodeStore", __LINE__, NODESTORE::loggerNodeStore, 6000,
+                    "add2NodeMap: Node ", id, " found twice during NodeId to Node Map");
     return Error("NodeStore Duplicated Node Pointer", 1);
 }
 
@@ -152,21 +198,27 @@ Error NodeStore::delNode(Node* const& node)
 
 void NodeStore::delOneNode(Node* const& node)
 {
-    nodeIdMap.erase(node->getNodeId());
-    nodeIdPathMap.erase(node->getNodeId());
-    for (auto it = nodePathMap.begin(); it != nodePathMap.end(); ++it) {
-        if (it->second == node) {
-            nodePathMap.erase(it);
-            break;
-        }
+    auto byId = idMap.find(node->getNodeId());
+    if (byId != idMap.end()) {
+        byId->second.node = nullptr;
+        if (byId->second.path.empty())
+            idMap.erase(byId);
     }
-    auto range = sensorMap.equal_range(static_cast<Node::SensorType>(*node));
-    for (auto it = range.first; it != range.second; ++it) {
-        if (it->second == node) {
-            sensorMap.erase(it);
-            break;
-        }
+    byId = idMap.find(node->getNodeId());
+    if (byId != idMap.end()) {
+        byId->second.path.clear();
+        if (!byId->second.node)
+            idMap.erase(byId);
     }
+    // Of the paths that lead to this node, the smallest goes. Removals are
+    // rare, so this walks the whole index instead of keeping a reverse one.
+    auto smallest = nodePathMap.end();
+    for (auto it = nodePathMap.begin(); it != nodePathMap.end(); ++it)
+        if (it->second == node && (smallest == nodePathMap.end() || it->first < smallest->first))
+            smallest = it;
+    if (smallest != nodePathMap.end())
+        nodePathMap.erase(smallest);
+    unlist(node);
 }
 
 void NodeStore::erase(std::string path)
@@ -181,15 +233,8 @@ void NodeStore::delNodeFromGetMap(std::string const& path)
 {
     SD::MutexGuard guard(storeLock);
     Node* node = nullptr;
-    if (nodePath2Node(path, &node).getStatus() != 0)
-        return;
-    auto range = sensorMap.equal_range(static_cast<Node::SensorType>(*node));
-    for (auto it = range.first; it != range.second; ++it) {
-        if (it->second == node) {
-            sensorMap.erase(it);
-            break;
-        }
-    }
+    if (nodePath2Node(path, &node).getStatus() == 0)
+        unlist(node);
 }
 
 void NodeStore::clear()
@@ -198,8 +243,7 @@ void NodeStore::clear()
     // and keeps a first open safe against a client still querying.
     SD::MutexGuard guard(storeLock);
     nodePathMap.clear();
-    nodeIdPathMap.clear();
-    nodeIdMap.clear();
+    idMap.clear();
     sensorMap.clear();
 }
 
@@ -217,10 +261,10 @@ Error NodeStore::getNode(std::string path, Node** node) const
 
 Error NodeStore::nodeId2Node(unsigned int id, Node** node) const
 {
-    auto it = nodeIdMap.find(id);
-    if (it == nodeIdMap.end())
+    Node* const found = registeredNode(id);
+    if (!found)
         return status(1);
-    *node = it->second;
+    *node = found;
     return status(0);
 }
 
@@ -237,9 +281,8 @@ Error NodeStore::getMap(std::vector<Node*>& nodes) const
 {
     SD::MutexGuard guard(storeLock);
     nodes.clear();
-    nodes.reserve(sensorMap.size());
-    for (auto const& entry : sensorMap)
-        nodes.push_back(entry.second);
+    for (auto const& type : sensorMap)
+        nodes.insert(nodes.end(), type.second.begin(), type.second.end());
     return status(0);
 }
 
@@ -247,18 +290,27 @@ Error NodeStore::getMap(std::vector<Node*>& nodes, unsigned int sensor) const
 {
     SD::MutexGuard guard(storeLock);
     nodes.clear();
-    auto range = sensorMap.equal_range(static_cast<Node::SensorType>(sensor));
-    for (auto it = range.first; it != range.second; ++it)
-        nodes.push_back(it->second);
+    auto type = sensorMap.find(static_cast<Node::SensorType>(sensor));
+    if (type != sensorMap.end())
+        nodes = type->second;
     return status(0);
 }
 
 Error NodeStore::getAllNodes(std::vector<Node*>& nodes) const
 {
-    SD::MutexGuard guard(storeLock);
+    std::vector<std::pair<unsigned int, Node*> > byId;
+    {
+        SD::MutexGuard guard(storeLock);
+        byId.reserve(idMap.size());
+        for (auto const& entry : idMap)
+            if (entry.second.node)
+                byId.emplace_back(entry.first, entry.second.node);
+    }
+    std::sort(byId.begin(), byId.end(),
+              [](auto const& a, auto const& b) { return a.first < b.first; });
     nodes.clear();
-    nodes.reserve(nodeIdMap.size());
-    for (auto const& entry : nodeIdMap)
+    nodes.reserve(byId.size());
+    for (auto const& entry : byId)
         nodes.push_back(entry.second);
     return status(0);
 }
@@ -267,20 +319,33 @@ Error NodeStore::getAllNodes(std::vector<Node*>& nodes) const
 
 std::string NodeStore::calcNodePath(Node* node)
 {
-    return walkPath(node, &nodeIdPathMap, &nodePathMap);
+    std::vector<PendingPath> pending;
+    std::string path = walkPath(node, &pending);
+    cachePaths(pending);
+    return path;
 }
 
 std::string NodeStore::calcPathFromLinkedId(Node* node) const
 {
-    return walkPath(node, nullptr, nullptr);
+    return walkPath(node, nullptr);
 }
 
-std::string NodeStore::walkPath(Node* node, std::map<unsigned int, std::string>* idPaths,
-                                std::map<std::string, Node*>* paths) const
+void NodeStore::cachePaths(std::vector<PendingPath> const& pending)
 {
-    auto cached = nodeIdPathMap.find(node->getNodeId());
-    if (cached != nodeIdPathMap.end())
-        return cached->second;
+    // Neither index is overwritten: a cached path stays, and the first node
+    // to claim a path keeps it.
+    for (PendingPath const& p : pending) {
+        std::string& cached = idMap[p.node->getNodeId()].path;
+        if (cached.empty())
+            cached = p.path;
+        nodePathMap.emplace(p.path, p.node);
+    }
+}
+
+std::string NodeStore::walkPath(Node* node, std::vector<PendingPath>* pending) const
+{
+    if (std::string const* cached = cachedPath(node->getNodeId()))
+        return *cached;
 
     // Up: from the node to its nearest ancestor with a cached path, or to
     // the topmost registered one, which then counts as a root.
@@ -291,9 +356,8 @@ std::string NodeStore::walkPath(Node* node, std::map<unsigned int, std::string>*
         unsigned int const lid = current->getLinkedId();
         if (lid == 0 || lid == current->getNodeId())
             break;
-        auto parentPath = nodeIdPathMap.find(lid);
-        if (parentPath != nodeIdPathMap.end()) {
-            base = parentPath->second;
+        if (std::string const* parentPath = cachedPath(lid)) {
+            base = *parentPath;
             break;
         }
         Node* parent = nullptr;
@@ -302,7 +366,7 @@ std::string NodeStore::walkPath(Node* node, std::map<unsigned int, std::string>*
         // Registered nodes always have a cached path, so the walk cannot
         // loop; this bound only guards against a store corrupted by a
         // plug-in that changed ids of registered nodes.
-        if (chain.size() > nodeIdMap.size())
+        if (chain.size() > idMap.size())
             break;
         current = parent;
         chain.push_back(current);
@@ -317,10 +381,8 @@ std::string NodeStore::walkPath(Node* node, std::map<unsigned int, std::string>*
         if (!base.empty())
             uniqueid2topovec(base, kAllPairs, topovec);
         base = nodecode(topovec);
-        if (idPaths) {
-            idPaths->emplace(n->getNodeId(), base);
-            paths->emplace(base, n);
-        }
+        if (pending)
+            pending->push_back(PendingPath{n, base});
         chain.pop_back();
     }
     return base;
@@ -419,75 +481,97 @@ std::string NodeStore::hexstring(std::string const& s) const
     return detail::hexText(s);
 }
 
+namespace {
+
+// Value of each hexadecimal digit; 0xFF for any other character.
+struct HexDigits {
+    unsigned char value[256];
+    constexpr HexDigits() : value()
+    {
+        for (int c = 0; c < 256; ++c)
+            value[c] = 0xFF;
+        for (int c = '0'; c <= '9'; ++c)
+            value[c] = static_cast<unsigned char>(c - '0');
+        for (int c = 'a'; c <= 'f'; ++c)
+            value[c] = static_cast<unsigned char>(c - 'a' + 10);
+        for (int c = 'A'; c <= 'F'; ++c)
+            value[c] = static_cast<unsigned char>(c - 'A' + 10);
+    }
+};
+constexpr HexDigits kHexDigits;
+
+} // namespace
+
 std::string NodeStore::stringhex(std::string const& s) const
 {
-    // A padding digit: an odd-length text ends with a low nibble of 0, an
-    // even-length one with an ignored half byte.
-    std::string const t = s + "0";
-    std::string result;
-    result.reserve(t.size() / 2);
-    unsigned char acc = 0;
-    bool high = true;
-    for (std::size_t i = 0; i < t.size(); ++i) {
-        char const c = t[i];
-        unsigned int value;
-        if (c >= '0' && c <= '9') {
-            value = static_cast<unsigned int>(c - '0');
-        } else if (c >= 'a' && c <= 'f') {
-            value = static_cast<unsigned int>(c - 'a' + 10);
-        } else if (c >= 'A' && c <= 'F') {
-            value = static_cast<unsigned int>(c - 'A' + 10);
-        } else {
-            NS_LOG(3000, "stringHex: Invalid hexadecimal digit ", hexstring(s));
-            throw std::invalid_argument("Invalid hexadecimal digit");
-        }
-        if (high) {
-            acc = static_cast<unsigned char>((acc + value) * 16);
-        } else {
-            acc = static_cast<unsigned char>(acc + value);
-            if (acc == 0) {
-                NS_LOG(3000, "stringHex: Invalid null byte ", s);
-                throw std::invalid_argument("Invalid null byte");
-            }
-            result += static_cast<char>(acc);
-            acc = 0;
-        }
-        high = !high;
+    // The text is read as if one padding digit "0" followed it: an odd
+    // length ends with a low nibble of 0, an even one with an ignored half
+    // byte. Errors are reported for the first bad character or byte.
+    enum class Fault { None, Digit, NullByte } fault = Fault::None;
+    auto const* const text = reinterpret_cast<unsigned char const*>(s.data());
+    std::size_t const pairs = s.size() / 2;
+    std::string result((s.size() + 1) / 2, '\0');
+    for (std::size_t k = 0; k < pairs && fault == Fault::None; ++k) {
+        unsigned int const high = kHexDigits.value[text[2 * k]];
+        unsigned int const low = kHexDigits.value[text[2 * k + 1]];
+        unsigned int const byte = high << 4 | low;
+        if ((high | low) > 15)
+            fault = Fault::Digit;
+        else if (byte == 0)
+            fault = Fault::NullByte;
+        else
+            result[k] = static_cast<char>(byte);
+    }
+    if (fault == Fault::None && s.size() % 2 != 0) {
+        unsigned int const high = kHexDigits.value[text[s.size() - 1]];
+        if (high > 15)
+            fault = Fault::Digit;
+        else if (high == 0)
+            fault = Fault::NullByte;
+        else
+            result[pairs] = static_cast<char>(high << 4);
+    }
+    if (fault == Fault::Digit) {
+        NS_LOG(3000, "stringHex: Invalid hexadecimal digit ", hexstring(s));
+        throw std::invalid_argument("Invalid hexadecimal digit");
+    }
+    if (fault == Fault::NullByte) {
+        NS_LOG(3000, "stringHex: Invalid null byte ", s);
+        throw std::invalid_argument("Invalid null byte");
     }
     return result;
 }
 
 void NodeStore::uniqueid2topovec(std::string uid, unsigned int stop, TopoVec& topovec) const
 {
-    std::string s = b12String(std::move(uid));
-    if (s.empty())
+    // Reads the nibbles directly: 0 ends a pair, 1..12 are base-12 digits,
+    // 13 and 14 are skipped, 15 separates the instance from the type. A
+    // path whose last nibble does not end a pair is ended as if it did.
+    if (uid.empty())
         return;
-    if (s.back() != 'A')
-        s += 'A';
     unsigned int first = 0;
     unsigned int second = 0;
     unsigned int* target = &second;
-    for (char c : s) {
-        switch (c) {
-        case 'N':
-        case 'O':
-            break;
-        case 'A':
+    auto const take = [&](unsigned int nibble) {
+        if (nibble == 0) {
             topovec.emplace_back(first, second);
             if (first == stop)
-                return;
+                return false;
             first = 0;
             second = 0;
             target = &second;
-            break;
-        case 'P':
+        } else if (nibble == 15) {
             target = &first;
-            break;
-        default:
-            *target = *target * 12 + static_cast<unsigned int>(c - 'B');
-            break;
+        } else if (nibble < 13) {
+            *target = *target * 12 + (nibble - 1);
         }
-    }
+        return true;
+    };
+    for (unsigned char c : uid)
+        if (!take(c >> 4u) || !take(c & 15u))
+            return;
+    if ((static_cast<unsigned char>(uid.back()) & 15u) != 0)
+        take(0);
 }
 
 std::string NodeStore::nodecode(TopoVec topovec) const

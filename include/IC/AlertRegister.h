@@ -13,8 +13,10 @@
 #include <IC/Node.h>
 #include <SD/DateTime.h>
 
+#include <cstddef>
 #include <cstdint>
 #include <set>
+#include <unordered_map>
 #include <string>
 #include <vector>
 
@@ -35,6 +37,31 @@ enum MyRegType : std::uint32_t { FP_REGISTRATION = 0, CLIENT_REGISTRATION = 1 };
 // the alert's time stamp, one of its node paths, and the client's context.
 using SimpleAlertCallBack = void (*)(unsigned int code, SD::DateTime time, std::string path,
                                      void const* context);
+
+// What a dispatch works out once per batch and every register reuses: the
+// sensor type of each node path (74 when no node has it) and which alerts
+// name each path.
+class IC_API AlertBatch {
+public:
+    AlertBatch(NodeStore& store, std::vector<Alert> const& alerts);
+
+    // Sensor type of path number p of alert number a.
+    Node::SensorType sensorOf(std::size_t a, std::size_t p) const { return sensors[a][p]; }
+    // True when some path of the batch names no node.
+    bool hasUnknownPath() const { return unknownPath; }
+    // Ascending numbers of the alerts that name path; null when none does.
+    std::vector<std::size_t> const* alertsNaming(std::string const& path) const;
+    std::size_t distinctPaths() const { return byPath.size(); }
+    std::unordered_map<std::string, std::vector<std::size_t> > const& paths() const
+    {
+        return byPath;
+    }
+
+private:
+    std::vector<std::vector<Node::SensorType> > sensors;
+    std::unordered_map<std::string, std::vector<std::size_t> > byPath;
+    bool unknownPath = false;
+};
 
 // One pending delivery: the alerts one register takes from a batch.
 class IC_API AlertCall {
@@ -86,6 +113,10 @@ public:
     // this register asked for, each restricted to the matching paths.
     // Always false.
     bool filterAlerts(NodeStore& store, std::vector<Alert> const& alerts,
+                      std::vector<AlertCall>& calls, unsigned int type);
+    // The same with the batch's sensor types and path index worked out
+    // beforehand; what is delivered and logged is identical.
+    bool filterAlerts(AlertBatch const& batch, std::vector<Alert> const& alerts,
                       std::vector<AlertCall>& calls, unsigned int type);
 
     AlertCallBack getCallback() const { return callback; }

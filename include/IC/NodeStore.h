@@ -6,6 +6,10 @@
 // owns a node. Every public operation may be called from any thread; the
 // store's lock is re-entrant for its owner.
 //
+// Indexes are hash tables; the orders that callers see are kept: getMap
+// lists by ascending sensor type and order of addition, and removing a node
+// drops the smallest of the paths under which it is registered.
+//
 // Path code: each pair is written as its instance in base 12 (letters b..m,
 // most significant first), "p", its sensor type in base 12, "a"; the letter
 // string is packed two letters (nibbles a=0..p=15) to a byte, first letter in
@@ -18,6 +22,7 @@
 #include <SD/Mutex.h>
 
 #include <map>
+#include <unordered_map>
 #include <string>
 #include <utility>
 #include <vector>
@@ -112,15 +117,38 @@ public:
     std::string nodecode(TopoVec topovec) const;
 
 private:
-    // The walk shared by calcNodePath (which passes the two path caches to
-    // fill) and calcPathFromLinkedId (which passes null for both).
-    std::string walkPath(Node* node, std::map<unsigned int, std::string>* idPaths,
-                         std::map<std::string, Node*>* paths) const;
+    // What the store knows under one node id: the registered node (the
+    // id index) and the cached path (the path cache). Either may be absent:
+    // a path is cached for every node whose path was computed, registered
+    // or not. A computed path is never empty.
+    struct IdEntry {
+        Node* node = nullptr;
+        std::string path;
+    };
+    // A path computed for a node of the walk, not yet cached.
+    struct PendingPath {
+        Node* node;
+        std::string path;
+    };
 
-    std::multimap<Node::SensorType, Node*> sensorMap;
-    std::map<unsigned int, Node*> nodeIdMap;
-    std::map<unsigned int, std::string> nodeIdPathMap;
-    std::map<std::string, Node*> nodePathMap;
+    // The path of node, computed as calcNodePath does; the paths it would
+    // cache go to pending (topmost first) when pending is not null.
+    std::string walkPath(Node* node, std::vector<PendingPath>* pending) const;
+    // Caches what a walk computed, as calcNodePath does.
+    void cachePaths(std::vector<PendingPath> const& pending);
+    // add2NodeMap for a node whose walk was just made under the same lock.
+    Error add2NodeMapWalked(Node* node, std::string const& path,
+                            std::vector<PendingPath> const& pending);
+    Node* registeredNode(unsigned int id) const;
+    std::string const* cachedPath(unsigned int id) const;
+    void unlist(Node* node);
+
+    // By sensor type (ascending), in order of addition: what getMap lists.
+    std::map<Node::SensorType, std::vector<Node*> > sensorMap;
+    // The id index and the path cache, by node id.
+    std::unordered_map<unsigned int, IdEntry> idMap;
+    // Node by path; the first node to claim a path keeps it.
+    std::unordered_map<std::string, Node*> nodePathMap;
     mutable SD::Mutex storeLock;
 };
 
