@@ -1,0 +1,434 @@
+#include "LinuxHwMI.h"
+
+#include "DeviceScanner.h"
+#include "HwmonScanner.h"
+#include "Log.h"
+#include "ShippedAlerts.h"
+#include "SystemScanner.h"
+
+#include <SD/Event.h>
+#include <SD/Thread.h>
+
+#include <cstdlib>
+#include <exception>
+
+namespace linuxhw {
+
+namespace {
+
+constexpr unsigned int kDefaultPollMs = 5000;
+constexpr unsigned int kMaxNumber = 0xFFFF; // node ids carry 16 bits of our own
+
+IC::Error ok()
+{
+    return IC::Error(0, IC::Number(IC::Number::Generic), std::string());
+}
+
+unsigned char severityOf(unsigned int status)
+{
+    return status == shipped::kStatusCritical  ? shipped::kSeverityCritical
+           : status == shipped::kStatusWarning ? shipped::kSeverityWarning
+                                               : shipped::kSeverityInfo;
+}
+
+unsigned int pollInterval()
+{
+    char const* text = std::getenv("IC_LINUXHW_POLL_MS");
+    if (!text || !*text)
+        return kDefaultPollMs;
+    std::optional<long long> const ms = parseInteger(trim(text));
+    if (!ms || *ms < 10 || *ms > 3600000) {
+        LHW_LOG(kWarning, "IC_LINUXHW_POLL_MS='", text, "' is not 10..3600000; polling every ",
+                kDefaultPollMs, " ms");
+        return kDefaultPollMs;
+    }
+    return static_cast<unsigned int>(*ms);
+}
+
+// Queues one alert on path and logs it.
+void raiseAlert(std::vector<IC::Alert>& out, IC::Alert::ClassType cls, unsigned int status,
+                std::string const& path, std::string const& message)
+{
+    out.emplace_back(severityOf(status), cls, std::vector<std::string>{path}, status, message);
+    LHW_LOG(status == shipped::kStatusNormal ? kProgress : kWarning, "alert: ", message);
+}
+
+} // namespace
+
+class LinuxHwMI::PollThread : public SD::Thread {
+public:
+    PollThread(LinuxHwMI& mi, unsigned int ms) : mi_(mi), ms_(ms) {}
+    ~PollThread() override { join(); }
+
+    void stop() override { stop_.signal(); }
+
+    void* run(void*) override
+    {
+        while (stop_.waitMilliseconds(ms_) != 0) {
+            try {
+                mi_.poll();
+            } catch (std::exception const& e) {
+                LHW_LOG(kError, "poll failed: ", e.what());
+            } catch (...) {
+                LHW_LOG(kError, "poll failed with an unknown exception");
+            }
+        }
+        return nullptr;
+    }
+
+private:
+    LinuxHwMI& mi_;
+    unsigned int const ms_;
+    SD::Event stop_{true};
+};
+
+LinuxHwMI::LinuxHwMI() = default;
+
+LinuxHwMI::~LinuxHwMI()
+{
+    stopPolling();
+}
+
+void LinuxHwMI::registerNodeCallBacks(IC::NodeArrivalCallBack arrival, void const* context,
+                                      IC::NodeLookupCallBack)
+{
+    SD::MutexGuard g(lock_);
+    arrivalCB_ = arrival;
+    arrivalContext_ = context;
+}
+
+IC::Error LinuxHwMI::registerForAlerts(IC::AlertCallBack callback, void const* context)
+{
+    SD::MutexGuard g(lock_);
+    alertCB_ = callback;
+    alertContext_ = context;
+    return ok();
+}
+
+IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
+{
+    char const* rootEnv = std::getenv("IC_SYSFS_ROOT");
+    std::string const root = rootEnv && *rootEnv ? rootEnv : "/";
+    unsigned int const ms = pollInterval();
+    {
+        SD::MutexGuard g(lock_);
+        if (initialized_)
+            return IC::Error(1, IC::Number(IC::Number::Generic), "linuxhw: initialised twice");
+        initialized_ = true;
+        base_ = nodeIdBase & 0xFFFF0000u;
+        pollMs_ = ms;
+        reader_ = std::make_unique<SysfsReader>(root);
+    }
+    if (!reader_->isDirectory("sys") && !reader_->isDirectory("proc"))
+        LHW_LOG(kError, "no sys or proc directory below ", reader_->root(),
+                "; only the root and the system are reported");
+
+    DeviceList fixed;
+    std::set<unsigned int> packages;
+    SystemScanner(*reader_).scanFixed(fixed, packages);
+    {
+        SD::MutexGuard g(lock_);
+        packages_ = packages;
+    }
+    DeviceList const changing = scanChanging();
+    Outbox unused;
+    SD::MutexGuard g(lock_);
+    reconcile(fixed, false, false, unused);
+    reconcile(changing, true, false, unused);
+    LHW_LOG(kProgress, "reporting ", order_.size(), " nodes from ", reader_->root(),
+            ", polling every ", pollMs_, " ms");
+    return ok();
+}
+
+IC::Error LinuxHwMI::getMap(std::vector<IC::Node*>& nodes)
+{
+    SD::MutexGuard g(lock_);
+    for (std::string const& key : order_) {
+        Tracked const& t = tracked_.at(key);
+        if (t.present && t.node)
+            nodes.push_back(t.node);
+    }
+    // The polling starts once the library has the nodes and can take
+    // alerts on their paths.
+    if (!thread_ && initialized_) {
+        thread_ = std::make_unique<PollThread>(*this, pollMs_);
+        if (!thread_->start())
+            LHW_LOG(kError, "the polling thread did not start; readings stay as loaded");
+    }
+    return ok();
+}
+
+IC::Error LinuxHwMI::shutdown()
+{
+    stopPolling();
+    return ok();
+}
+
+void LinuxHwMI::release()
+{
+    // A reload releases without shutdown(); the thread must not outlive us.
+    stopPolling();
+    delete this;
+}
+
+void LinuxHwMI::stopPolling()
+{
+    PollThread* thread = nullptr;
+    {
+        SD::MutexGuard g(lock_);
+        thread = thread_.get();
+    }
+    if (thread) {
+        thread->stop();
+        thread->join();
+    }
+}
+
+DeviceList LinuxHwMI::scanChanging()
+{
+    DeviceList out;
+    SystemScanner(*reader_).scanDimms(out);
+    DeviceScanner devices(*reader_);
+    devices.scanNetwork(out);
+    devices.scanDisks(out);
+    devices.scanPowerSupplies(out);
+    HwmonScanner sensors(*reader_, packages_);
+    if (sensors.scanHwmon(out) == 0)
+        sensors.scanThermalZones(out);
+    return out;
+}
+
+void LinuxHwMI::poll()
+{
+    DeviceList const found = scanChanging();
+    Outbox out;
+    {
+        SD::MutexGuard g(lock_);
+        reconcile(found, true, true, out);
+    }
+    deliver(out);
+}
+
+unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)
+{
+    if (t.hasInstance && t.claimParent == d.parentKey && t.device.type == d.type)
+        return t.instance;
+    unsigned int instance = d.instance;
+    for (int tries = 0; tries < 1024; ++tries, instance += d.probeStep) {
+        auto const slot = std::make_tuple(d.parentKey, static_cast<unsigned int>(d.type), instance);
+        auto const claim = claims_.find(slot);
+        if (claim == claims_.end() || claim->second == d.key) {
+            claims_[slot] = d.key;
+            break;
+        }
+    }
+    t.instance = instance;
+    t.hasInstance = true;
+    t.claimParent = d.parentKey;
+    return instance;
+}
+
+void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce, Outbox& out)
+{
+    std::set<std::string> seen;
+    for (Device const& d : found) {
+        if (!seen.insert(d.key).second)
+            continue; // two entries of one identity: the first one counts
+        auto it = tracked_.find(d.key);
+        if (it != tracked_.end() && it->second.present) {
+            update(it->second, d, out);
+            continue;
+        }
+        unsigned int parentId = 0;
+        if (!d.parentKey.empty()) {
+            auto const parent = tracked_.find(d.parentKey);
+            if (parent == tracked_.end() || !parent->second.present || !parent->second.node) {
+                LHW_LOG(kWarning, d.description, " left out: its parent ", d.parentKey,
+                        " is not there");
+                continue;
+            }
+            parentId = parent->second.node->getNodeId();
+        }
+        bool const isNew = it == tracked_.end();
+        if (isNew && nextNumber_ > kMaxNumber) {
+            LHW_LOG(kError, d.description, " left out: all node ids are used");
+            continue;
+        }
+        Tracked& t = tracked_[d.key];
+        if (isNew) {
+            t.number = nextNumber_++;
+            order_.push_back(d.key);
+        }
+        unsigned int const instance = claimInstance(t, d);
+        unsigned int const id = base_ | t.number;
+        // A device that comes back gets a new node: the library may still
+        // hold the old one, which it dropped from its store.
+        nodes_.push_back(std::make_unique<HwNode>(d.type, instance, id, parentId, d.description, id));
+        t.node = nodes_.back().get();
+        for (IC::Node::Property const& p : d.properties)
+            t.node->setProperty(p.name, p.value, p.unit);
+        t.device = d;
+        t.present = true;
+        t.changing = changing;
+        t.raised = shipped::kStatusNormal;
+        t.linkLost = false;
+        if (announce) {
+            out.arrivals.push_back(t.node);
+            LHW_LOG(kProgress, "arrived: ", d.description);
+        }
+    }
+    if (changing)
+        removeMissing(seen, out);
+}
+
+void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
+{
+    HwNode* const node = t.node;
+    std::vector<IC::Node::Property> const now = node->getProperties();
+    for (IC::Node::Property const& p : d.properties) {
+        auto const same = std::find_if(now.begin(), now.end(), [&p](IC::Node::Property const& q) {
+            return q.name == p.name && q.value == p.value && q.unit == p.unit;
+        });
+        if (same == now.end())
+            node->setProperty(p.name, p.value, p.unit);
+    }
+    for (IC::Node::Property const& q : now) {
+        bool const kept = std::any_of(d.properties.begin(), d.properties.end(),
+                                      [&q](IC::Node::Property const& p) { return p.name == q.name; });
+        if (!kept)
+            node->removeProperty(q.name);
+    }
+
+    Device const before = t.device;
+    t.device = d;
+    std::string const path = node->knownPath();
+    auto raise = [&](IC::Alert::ClassType cls, unsigned int status, std::string const& message) {
+        raiseAlert(out.alerts, cls, status, path, message);
+    };
+
+    switch (d.watch) {
+    case Watch::None:
+        break;
+    case Watch::Condition:
+        if (d.status == kStatusUnknown || d.status == t.raised || path.empty())
+            break;
+        raise(shipped::kThreshold, d.status, d.message);
+        t.raised = d.status;
+        break;
+    case Watch::Link:
+        if (!d.linkKnown) {
+            t.device.linkKnown = before.linkKnown; // keep the last known state
+            t.device.linkUp = before.linkUp;
+            break;
+        }
+        if (path.empty())
+            break;
+        if (!d.linkUp && !t.linkLost && before.linkKnown && before.linkUp) {
+            raise(shipped::kLink, shipped::kStatusWarning, d.description + " lost its link");
+            t.linkLost = true;
+        } else if (d.linkUp && t.linkLost) {
+            raise(shipped::kLink, shipped::kStatusNormal, d.description + " has its link back");
+            t.linkLost = false;
+        }
+        break;
+    case Watch::MemoryErrors: {
+        // An unreadable counter keeps its last value for the comparison.
+        if (d.corrected < 0)
+            t.device.corrected = before.corrected;
+        if (d.uncorrected < 0)
+            t.device.uncorrected = before.uncorrected;
+        if (path.empty())
+            break;
+        auto growth = [](long long now, long long was) { return now >= 0 && was >= 0 && now > was ? now - was : 0; };
+        long long const ce = growth(d.corrected, before.corrected);
+        long long const ue = growth(d.uncorrected, before.uncorrected);
+        if (ue > 0) {
+            raise(shipped::kMemoryErrors, shipped::kStatusCritical,
+                  d.description + ": " + std::to_string(ue) + " new uncorrected memory errors (" +
+                      std::to_string(d.uncorrected) + " in all)");
+        } else if (ce > 0) {
+            raise(shipped::kMemoryErrors, shipped::kStatusWarning,
+                  d.description + ": " + std::to_string(ce) + " new corrected memory errors (" +
+                      std::to_string(d.corrected) + " in all)");
+        } else if (d.corrected == 0 && d.uncorrected == 0 &&
+                   (before.corrected > 0 || before.uncorrected > 0)) {
+            raise(shipped::kMemoryErrors, shipped::kStatusNormal,
+                  d.description + ": error counters were reset");
+        }
+        break;
+    }
+    }
+}
+
+void LinuxHwMI::removeMissing(std::set<std::string> const& seen, Outbox& out)
+{
+    std::set<std::string> gone;
+    std::multimap<std::string, std::string> children;
+    for (std::string const& key : order_) {
+        Tracked& t = tracked_.at(key);
+        if (t.present && t.changing && seen.count(key) == 0) {
+            gone.insert(key);
+            t.present = false;
+        }
+        children.emplace(t.device.parentKey, key);
+    }
+    for (std::string const& key : order_) {
+        if (gone.count(key) == 0 || gone.count(tracked_.at(key).device.parentKey) != 0)
+            continue;
+        // One alert for the topmost removed device and its removed children.
+        std::vector<std::string> paths;
+        std::vector<std::string> pending{key};
+        while (!pending.empty()) {
+            std::string const k = pending.back();
+            pending.pop_back();
+            std::string const path = tracked_.at(k).node->knownPath();
+            if (!path.empty())
+                paths.push_back(path);
+            auto const range = children.equal_range(k);
+            for (auto c = range.first; c != range.second; ++c)
+                if (gone.count(c->second) != 0)
+                    pending.push_back(c->second);
+        }
+        std::string const message = tracked_.at(key).device.description + " was removed";
+        LHW_LOG(kWarning, message);
+        if (!paths.empty())
+            out.removals.emplace_back(shipped::kSeverityWarning, shipped::kNodeRemoval, paths,
+                                      shipped::kStatusNormal, message);
+    }
+}
+
+void LinuxHwMI::deliver(Outbox& out)
+{
+    // Our lock is not held: the library's callbacks may call back into us.
+    if (!out.removals.empty() && alertCB_)
+        alertCB_(out.removals, alertContext_);
+    for (HwNode* node : out.arrivals) {
+        if (!arrivalCB_)
+            break;
+        IC::Error const e = arrivalCB_(node, arrivalContext_);
+        if (e.getStatus() != 0)
+            LHW_LOG(kWarning, "the library did not take ", node->getDescription(), ": ",
+                    e.getText(), " (status ", static_cast<unsigned int>(e.getStatus()), ")");
+    }
+    if (!out.alerts.empty() && alertCB_)
+        alertCB_(out.alerts, alertContext_);
+}
+
+} // namespace linuxhw
+
+extern "C" __attribute__((visibility("default"))) unsigned char
+OpenMI(IC::ManagementInterface** mi, IC::Error** err)
+{
+    static IC::Error good(0, IC::Number(IC::Number::Generic), std::string());
+    static IC::Error bad(1, IC::Number(IC::Number::Generic), "linuxhw: out of memory");
+    if (!mi || !err)
+        return 1;
+    try {
+        *mi = new linuxhw::LinuxHwMI();
+    } catch (...) {
+        *err = &bad;
+        return 1;
+    }
+    *err = &good;
+    return 0;
+}
