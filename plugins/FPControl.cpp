@@ -41,6 +41,10 @@ void diagError(Error* error, std::string context)
 
 } // namespace FP_CONTROL
 
+// The steps of one library are logged as the loader's own.
+#define FP_LOG_LOAD(level, ...) \
+    HGLog::logEvent("myloadFPs", "FPControl", __LINE__, FP_CONTROL::loggerFPControl, level, __VA_ARGS__)
+
 namespace {
 
 Error success()
@@ -56,18 +60,18 @@ bool loadOne(libstruct& record, unsigned short& counter, std::vector<libstruct>&
     auto const open =
         reinterpret_cast<OpenFPFunction>(SD::PlatformUtilities::loadSymbol(record.handle, symbol));
     if (!open) {
-        FP_LOG(6000, "myloadFPs: ", record.path, " OpenFP not found");
+        FP_LOG_LOAD(6000, "myloadFPs: ", record.path, " OpenFP not found");
         return false;
     }
     FunctionalPlugIn* fp = nullptr;
     Error* err = nullptr;
     unsigned char const code = open(&fp, &err);
     if (code != 0) {
-        FP_LOG(6000, "myloadFPs: ", record.path, " OpenFP failed, code=", code);
+        FP_LOG_LOAD(6000, "myloadFPs: ", record.path, " OpenFP failed, code=", code);
         return false;
     }
     if (!err) {
-        FP_LOG(6000, "myloadFPs: ", record.path, " Pointer to Error is NULL");
+        FP_LOG_LOAD(6000, "myloadFPs: ", record.path, " Pointer to Error is NULL");
         return false;
     }
     if (err->getStatus() != 0) {
@@ -75,13 +79,13 @@ bool loadOne(libstruct& record, unsigned short& counter, std::vector<libstruct>&
         return false;
     }
     if (!fp) {
-        FP_LOG(6000, "myloadFPs: ", record.path, " OpenFP pointer is NULL");
+        FP_LOG_LOAD(6000, "myloadFPs: ", record.path, " OpenFP pointer is NULL");
         return false;
     }
     unsigned int const base = static_cast<unsigned int>(counter) << 16;
-    FP_LOG(3000, "myloadFPs: ", record.path, " Initialize");
+    FP_LOG_LOAD(3000, "myloadFPs: ", record.path, " Initialize");
     Error result = fp->Initialize(base, services);
-    FP_LOG(3000, "myloadFPs: ", record.path, " Initialize Done");
+    FP_LOG_LOAD(3000, "myloadFPs: ", record.path, " Initialize Done");
     if (result.getStatus() != 0) {
         FP_CONTROL::diagError(&result, "FP Initialize()");
         return false;

@@ -39,6 +39,10 @@ void diagError(Error* error, std::string context)
 
 } // namespace MI_CONTROL
 
+// The steps of one library are logged as the loader's own.
+#define MI_LOG_LOAD(level, ...) \
+    HGLog::logEvent("myloadMIs", "MIControl", __LINE__, MI_CONTROL::loggerMIControl, level, __VA_ARGS__)
+
 namespace {
 
 Error success()
@@ -57,18 +61,18 @@ bool loadOne(libstruct& record, unsigned short& counter, std::vector<libstruct>&
     auto const open =
         reinterpret_cast<OpenMIFunction>(SD::PlatformUtilities::loadSymbol(record.handle, symbol));
     if (!open) {
-        MI_LOG(6000, "myloadMIs: ", record.path, " OpenMI() function is missing.");
+        MI_LOG_LOAD(6000, "myloadMIs: ", record.path, " OpenMI() function is missing.");
         return false;
     }
     ManagementInterface* mi = nullptr;
     Error* err = nullptr;
     unsigned char const code = open(&mi, &err);
     if (code != 0) {
-        MI_LOG(6000, "myloadMIs: ", record.path, " OpenMI failed code=", code);
+        MI_LOG_LOAD(6000, "myloadMIs: ", record.path, " OpenMI failed code=", code);
         return false;
     }
     if (!err) {
-        MI_LOG(6000, "myloadMIs: ", record.path, " Pointer to Error is NULL");
+        MI_LOG_LOAD(6000, "myloadMIs: ", record.path, " Pointer to Error is NULL");
         return false;
     }
     if (err->getStatus() != 0) {
@@ -76,16 +80,16 @@ bool loadOne(libstruct& record, unsigned short& counter, std::vector<libstruct>&
         return false;
     }
     if (!mi) {
-        MI_LOG(6000, "myloadMIs: ", record.path, " OpenMI pointer to MI is NULL");
+        MI_LOG_LOAD(6000, "myloadMIs: ", record.path, " OpenMI pointer to MI is NULL");
         return false;
     }
     // The MI may report nodes as soon as it has the callbacks, before it is
     // initialised.
     mi->registerNodeCallBacks(loadCB, context, getNodeCB);
     unsigned int const base = static_cast<unsigned int>(counter) << 16;
-    MI_LOG(3000, "myloadMIs: ", record.path, " Initialize");
+    MI_LOG_LOAD(3000, "myloadMIs: ", record.path, " Initialize");
     Error result = mi->Initialize(base, interfaceVersion, moduleVersion);
-    MI_LOG(3000, "myloadMIs: ", record.path, " Initialize Done");
+    MI_LOG_LOAD(3000, "myloadMIs: ", record.path, " Initialize Done");
     if (result.getStatus() != 0) {
         MI_CONTROL::diagError(&result, "MI Initialize");
         return false;
