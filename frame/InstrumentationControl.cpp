@@ -5,6 +5,7 @@
 #include <IC/MIControl.h>
 #include <SD/PlatformUtilities.h>
 
+#include "DiagError.h"
 #include "HexText.h"
 #include "InstCtrlPrivate.h"
 
@@ -221,10 +222,7 @@ namespace InstCtrl {
 
 void diagError(Error* error, std::string context)
 {
-    if (error)
-        IC_LOG(6000, context, ": ", *error);
-    else
-        IC_LOG(6000, context, ": ", "(no error)");
+    detail::reportError("InstrumentationControl", loggerIC, error, context);
 }
 
 std::string hexstring(std::string s)

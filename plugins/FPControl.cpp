@@ -3,6 +3,7 @@
 #include <HGLog/HGLogger.h>
 #include <SD/PlatformUtilities.h>
 
+#include "../frame/DiagError.h"
 #include "ReloadScan.h"
 
 #include <algorithm>
@@ -33,10 +34,7 @@ bool libLT(libstruct a, libstruct b)
 
 void diagError(Error* error, std::string context)
 {
-    if (error)
-        FP_LOG(6000, context, ": ", *error);
-    else
-        FP_LOG(6000, context, ": ", "(no error)");
+    detail::reportError("FPControl", loggerFPControl, error, context);
 }
 
 } // namespace FP_CONTROL

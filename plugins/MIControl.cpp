@@ -3,6 +3,7 @@
 #include <HGLog/HGLogger.h>
 #include <SD/PlatformUtilities.h>
 
+#include "../frame/DiagError.h"
 #include "ReloadScan.h"
 
 #include <algorithm>
@@ -31,10 +32,7 @@ bool libLT(libstruct a, libstruct b)
 
 void diagError(Error* error, std::string context)
 {
-    if (error)
-        MI_LOG(6000, context, ": ", *error);
-    else
-        MI_LOG(6000, context, ": ", "(no error)");
+    detail::reportError("MIControl", loggerMIControl, error, context);
 }
 
 } // namespace MI_CONTROL
