@@ -775,6 +775,27 @@ TEST_F(LinuxHwTest, UnloadStopsTheThreadPromptly)
     EXPECT_LT(std::chrono::steady_clock::now() - start, 2s);
 }
 
+TEST_F(LinuxHwTest, UnloadingMakesTheLibraryForgetEveryNode)
+{
+    // The nodes' code leaves with the plug-in, so no pointer may stay behind.
+    useTree("small");
+    open();
+    std::vector<IC::Node*> nodes;
+    ASSERT_EQ(ic_->getAllNodes(nodes).getStatus(), 0);
+    ASSERT_EQ(nodes.size(), 17u);
+    std::vector<std::string> paths;
+    for (IC::Node* n : nodes)
+        paths.push_back(n->getPath());
+    close();
+    std::vector<IC::Node*> left;
+    IC::InstCtrl::nodestore.getAllNodes(left);
+    EXPECT_TRUE(left.empty());
+    for (std::string const& path : paths) {
+        IC::Node* found = nullptr;
+        EXPECT_EQ(IC::InstCtrl::nodestore.getNode(path, &found).getStatus(), 1);
+    }
+}
+
 TEST_F(LinuxHwTest, RealMachineLoads)
 {
     setenv("IC_SYSFS_ROOT", "/", 1);

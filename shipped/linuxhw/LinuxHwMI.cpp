@@ -168,6 +168,23 @@ void LinuxHwMI::release()
 {
     // A reload releases without shutdown(); the thread must not outlive us.
     stopPolling();
+    // The library keeps pointers to our nodes, and their code leaves with
+    // this library: have it forget them first, with one removal naming all.
+    std::vector<std::string> paths;
+    {
+        SD::MutexGuard g(lock_);
+        std::set<std::string> seen;
+        for (auto const& node : nodes_) {
+            std::string path = node->knownPath();
+            if (!path.empty() && seen.insert(path).second)
+                paths.push_back(std::move(path));
+        }
+    }
+    if (alertCB_ && !paths.empty())
+        alertCB_(std::vector<IC::Alert>{IC::Alert(shipped::kSeverityInfo, shipped::kNodeRemoval,
+                                                  paths, shipped::kStatusNormal,
+                                                  "linuxhw unloaded")},
+                 alertContext_);
     delete this;
 }
 

@@ -30,7 +30,9 @@
 //                    status 1) per removed device carrying its path and the
 //                    paths of its removed children.
 //   A device that appears is handed to the library's arrival callback, which
-//   raises the class-3 alert itself.
+//   raises the class-3 alert itself. When the interface is released, one
+//   removal (severity information, status 1) names every node it reported,
+//   so that the library drops its pointers before this library's code goes.
 #pragma once
 
 #include "Device.h"
