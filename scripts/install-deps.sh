@@ -8,6 +8,7 @@ packages=(
   libgtest-dev libgmock-dev
   liblog4cxx-dev
   libcli11-dev nlohmann-json3-dev
+  libbenchmark-dev
 )
 
 missing=()
