@@ -186,6 +186,10 @@ std::size_t HwmonScanner::scanHwmon(DeviceList& out)
             if (package && packages_.count(*package) == 0)
                 package.reset();
         }
+        // Plain values from here on: GCC's -O2 flow analysis misreads the
+        // optional inside the loop below.
+        bool const onPackage = package.has_value();
+        unsigned int const packageId = package.value_or(0);
 
         for (std::string const& f : files) {
             Kind const* kind = nullptr;
@@ -202,10 +206,10 @@ std::size_t HwmonScanner::scanHwmon(DeviceList& out)
             d.key = "hwmon:" + chipKey + ":" + prefix;
             d.type = kind->type;
             d.watch = Watch::Condition;
-            if (package) {
-                d.parentKey = cpuKey(*package);
+            if (onPackage) {
+                d.parentKey = cpuKey(packageId);
                 d.instance = index;
-                d.description = "CPU " + std::to_string(*package) + " " + l + " " + kind->word;
+                d.description = "CPU " + std::to_string(packageId) + " " + l + " " + kind->word;
             } else {
                 d.parentKey = kChassisKey;
                 d.instance = chipHash << 8 | index;
