@@ -7,16 +7,19 @@
 #   scripts/test.sh            normal + ASan/UBSan
 #   scripts/test.sh --tsan     normal + ASan/UBSan + TSan
 #   scripts/test.sh --quick    normal build only
+#   scripts/test.sh --soak     also the long open/unload soak (10,000 cycles)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 quick=0
+soak=0
 tsan=${IC_TSAN:-0}
 for arg in "$@"; do
   case "$arg" in
     --quick) quick=1 ;;
     --tsan) tsan=1 ;;
-    *) echo "usage: $0 [--quick] [--tsan]" >&2; exit 2 ;;
+    --soak) soak=1 ;;
+    *) echo "usage: $0 [--quick] [--tsan] [--soak]" >&2; exit 2 ;;
   esac
 done
 
@@ -37,17 +40,20 @@ build_and_test() {
   (cd "build/${name}" && ctest --output-on-failure -j "${jobs}" "${ctest_args[@]}")
 }
 
-build_and_test normal
+build_and_test normal -LE soak-long
+if [[ $soak -eq 1 ]]; then
+  (cd build/normal && ctest --output-on-failure -L soak-long)
+fi
 
 if [[ $quick -eq 0 ]]; then
   export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1:detect_stack_use_after_return=1
   export UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1
-  build_and_test asan -- -DIC_SANITIZE=address,undefined
+  build_and_test asan -LE soak-long -- -DIC_SANITIZE=address,undefined
 fi
 
 if [[ $tsan -eq 1 ]]; then
   export TSAN_OPTIONS="halt_on_error=1:second_deadlock_stack=1:detect_deadlocks=1"
   # The installed-package test only rebuilds the consumer; it says nothing
   # about threads.
-  build_and_test tsan -LE package -- -DIC_SANITIZE=thread
+  build_and_test tsan -LE 'package|soak-long' -- -DIC_SANITIZE=thread
 fi

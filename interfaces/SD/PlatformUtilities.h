@@ -23,9 +23,31 @@ public:
     static std::string getBriscaFPDir();
 
     // Opens a shared library with all its symbols resolved now and kept
-    // local to it. Only regular files (or links to them) are opened. Returns
-    // null, after one log line naming the file and the reason, when it
-    // cannot be opened.
+    // local to it (RTLD_NOW | RTLD_LOCAL). Returns null, after one log line
+    // naming the file and the reason, when it cannot be opened or is not
+    // trusted.
+    //
+    // Opening a library runs its code, so only a trusted file is opened.
+    // After links are resolved, the file must be a regular file owned by
+    // root or the effective user and not writable by group or others; every
+    // directory from the file's own up to "/" must be owned by root or the
+    // effective user and not writable by group or others, except that such a
+    // directory with the sticky bit (like /tmp) is accepted when the entry
+    // below it is owned by root or the effective user.
+    //
+    // The path is checked one component at a time, each opened relative to
+    // the directory checked before it without following links, and the
+    // library is loaded through /proc/self/fd of the descriptor that was
+    // checked, so that a file swapped in after the check is not the one
+    // loaded. A library whose run path or dependencies use $ORIGIN is
+    // loaded by its resolved path instead (the loader would work $ORIGIN out
+    // from the /proc name), and what was mapped is compared with what was
+    // checked. Not covered: the libraries it depends on are found and loaded
+    // by the system loader without these checks.
+    //
+    // IC_PLUGIN_TRUST=off (read on every call) switches the owner and
+    // permission checks off for development; each load then logs a warning
+    // saying so. Non-regular files are refused either way.
     static _LibraryHandle* loadLibrary(char const* path);
     // The address of a symbol of the library; null when it is missing.
     static void* loadSymbol(_LibraryHandle* handle, char* name);
