@@ -1,65 +1,30 @@
 // Tests of IC::AlertRegister (the filters of one (callback, context) pair,
 // their removal codes and the filtering of a batch) and of IC::AlertCall
-// (one pending delivery).
+// (one pending delivery). What dispatch makes of them is tested with the
+// library's entry points.
 #include <IC/AlertRegister.h>
 
-#include <HGLog/HGLogger.h>
-#include <IC/Alert.h>
 #include <IC/AlertStore.h>
-#include <IC/Error.h>
-#include <IC/Node.h>
-#include <IC/NodeStore.h>
-#include <IC/Number.h>
 
-#include <LogCapture.h>
-
-#include <gtest/gtest.h>
-
-#include <chrono>
-#include <cstdint>
-#include <set>
-#include <sstream>
-#include <string>
-#include <thread>
-#include <vector>
+#include "StoreSupport.h"
 
 namespace {
 
 using IC::Alert;
 using IC::AlertCall;
 using IC::AlertRegister;
-using IC::Node;
 using Paths = std::vector<std::string>;
-using ST = Node::SensorType;
+using Strings = std::vector<std::string>;
+using ST = IC::Node::SensorType;
 
-std::string const kLogger = "Helmgard.IC.InstrumentationControl.AlertRegister";
+ictest::Source const kAR{"Helmgard.IC.InstrumentationControl.AlertRegister", "AlertRegister"};
 constexpr unsigned int kFP = 0;
 constexpr unsigned int kMI = 1;
 
 Alert::ClassType cls(unsigned int n) { return static_cast<Alert::ClassType>(n); }
-
-Alert alert(unsigned int c, Paths paths, unsigned int status = 2, std::string msg = "m",
-            unsigned char sev = 3)
+Alert alert(unsigned int c, Paths paths, unsigned int status = 2, std::string msg = "m", unsigned char sev = 3)
 {
     return Alert(sev, cls(c), std::move(paths), status, std::move(msg));
-}
-
-std::string hex(std::string const& s)
-{
-    static char const digits[] = "0123456789abcdef";
-    std::string out;
-    for (unsigned char c : s) {
-        out.push_back(digits[c >> 4]);
-        out.push_back(digits[c & 15]);
-    }
-    return out;
-}
-
-std::string addr(void const* p)
-{
-    std::ostringstream os;
-    os << p;
-    return os.str();
 }
 
 // ---- callbacks that remember what they were given ----
@@ -74,503 +39,242 @@ IC::AlertStore* gWatched = nullptr;
 
 IC::Error recordA(std::vector<Alert> const& alerts, void const* context)
 {
-    std::size_t stored = 0;
-    if (gWatched) {
-        std::vector<Alert> now;
+    std::vector<Alert> now;
+    if (gWatched)
         gWatched->getAsserted(now);
-        stored = now.size();
-    }
-    gDeliveries.push_back({context, alerts, stored});
+    gDeliveries.push_back({context, alerts, now.size()});
     return IC::Error(1, IC::Number(IC::Number::Generic), "ignored by the library");
 }
-
-IC::Error recordB(std::vector<Alert> const& alerts, void const* context)
-{
-    gDeliveries.push_back({context, alerts, 0});
-    return IC::Error(0, IC::Number(IC::Number::Generic), "");
-}
+IC::Error recordB(std::vector<Alert> const& alerts, void const* context) { return recordA(alerts, context); }
 
 int gCtx1 = 1, gCtx2 = 2;
-
-// Exactly one event with this message on each channel, on this module's
-// logger with the given level and function.
-void expectEvent(ictest::LogCapture const& cap, std::string const& message, int level,
-                 std::string const& function)
-{
-    std::vector<HGLog::Record> logs, traces;
-    for (auto const& r : cap.records())
-        if (r.message == message)
-            (r.channel == HGLog::Channel::Log ? logs : traces).push_back(r);
-    ASSERT_EQ(logs.size(), 1u) << "log channel: '" << message << "'";
-    ASSERT_EQ(traces.size(), 1u) << "trace channel: '" << message << "'";
-    for (auto const* r : {&logs[0], &traces[0]}) {
-        EXPECT_EQ(r->level, level) << message;
-        EXPECT_EQ(r->function, function) << message;
-        EXPECT_EQ(r->file, "AlertRegister") << message;
-        EXPECT_EQ(r->logger, kLogger) << message;
-    }
-    EXPECT_EQ(logs[0].line, traces[0].line);
-}
-
-std::size_t countPrefix(ictest::LogCapture const& cap, std::string const& prefix)
-{
-    std::size_t n = 0;
-    for (auto const& m : cap.messages())
-        n += m.rfind(prefix, 0) == 0;
-    return n;
-}
-
-// A small tree: ROOT <- CPU 0, CPU 1, Fan 0, in a store of the test's own.
-class WithNodes : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        gDeliveries.clear();
-        gWatched = nullptr;
-        for (Node* n : {&root, &cpu0, &cpu1, &fan0}) {
-            bool isNew = false;
-            ASSERT_EQ(store.addNodeIfNew(n, isNew).getStatus(), 0);
-            ASSERT_TRUE(isNew);
-        }
-        P0 = cpu0.getPath();
-        P1 = cpu1.getPath();
-        PF = fan0.getPath();
-        ASSERT_FALSE(P0.empty());
-        ASSERT_NE(P0, P1);
-    }
-    void TearDown() override { gWatched = nullptr; }
-
-    // Filters one batch through r; expects false and returns the calls added.
-    std::vector<AlertCall> filter(AlertRegister& r, std::vector<Alert> const& batch,
-                                  unsigned int type)
-    {
-        std::vector<AlertCall> calls;
-        EXPECT_FALSE(r.filterAlerts(store, batch, calls, type));
-        return calls;
-    }
-
-    IC::NodeStore store;
-    Node root{ST::ROOT, 0, 1, 0, "root"};
-    Node cpu0{ST::CPU, 0, 2, 1, "cpu 0"};
-    Node cpu1{ST::CPU, 1, 3, 1, "cpu 1"};
-    Node fan0{ST::Fan, 0, 4, 1, "fan 0"};
-    std::string P0, P1, PF;
-    std::string const unknown = std::string("\x7e\x7f\x01", 3);
-};
-
-using AlertRegisterFilters = WithNodes;
-using AlertCallTest = WithNodes;
-
-} // namespace
 
 // ---------------------------------------------------------------------------
 // Building up and tearing down a register
 // ---------------------------------------------------------------------------
 
-TEST(AlertRegisterSets, NewRegisterIsEmptyAndKeepsItsArguments)
+TEST(AlertRegisterSets, AddInsertsOnceWithoutComparingTheCallback)
 {
     AlertRegister r(recordA, &gCtx1, 1);
-    EXPECT_EQ(r.getCallback(), &recordA);
-    EXPECT_EQ(r.getContext(), &gCtx1);
-    EXPECT_EQ(r.getRegType(), 1u);
-    EXPECT_TRUE(r.getClasses().empty());
-    EXPECT_TRUE(r.getSensorTypes().empty());
-    EXPECT_TRUE(r.getNodePaths().empty());
+    EXPECT_TRUE(r.getCallback() == &recordA && r.getContext() == &gCtx1 && r.getRegType() == 1u);
     EXPECT_EQ(AlertRegister(recordB, nullptr, 0).getRegType(), 0u);
-}
-
-TEST(AlertRegisterSets, AddInsertsOnceAndAlwaysSucceeds)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    EXPECT_TRUE(r.add(recordA, ST::CPU));
-    EXPECT_TRUE(r.add(recordA, ST::CPU));
-    EXPECT_TRUE(r.add(recordA, cls(5)));
-    EXPECT_TRUE(r.add(recordA, cls(5)));
-    EXPECT_TRUE(r.add(recordA, Paths{"b", "a", "b"}));
-    EXPECT_TRUE(r.add(recordA, Paths{"a"}));
-    EXPECT_TRUE(r.add(recordA, Paths{}));
+    EXPECT_TRUE(r.getClasses().empty() && r.getSensorTypes().empty() && r.getNodePaths().empty());
+    for (IC::AlertCallBack cb : {&recordA, &recordB, static_cast<IC::AlertCallBack>(nullptr)})
+        EXPECT_TRUE(r.add(cb, ST::CPU) && r.add(cb, cls(5)) && r.add(cb, Paths{"b", "a", "b"}) && r.add(cb, Paths{}));
     EXPECT_EQ(r.getSensorTypes(), std::set<ST>{ST::CPU});
     EXPECT_EQ(r.getClasses(), std::set<Alert::ClassType>{cls(5)});
     EXPECT_EQ(r.getNodePaths(), (std::set<std::string>{"a", "b"}));
-}
-
-TEST(AlertRegisterSets, AddDoesNotCompareTheCallback)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    EXPECT_TRUE(r.add(recordB, ST::Fan));
-    EXPECT_TRUE(r.add(nullptr, cls(2)));
-    EXPECT_TRUE(r.add(recordB, Paths{"p"}));
-    EXPECT_EQ(r.getSensorTypes().size(), 1u);
-    EXPECT_EQ(r.getClasses().size(), 1u);
-    EXPECT_EQ(r.getNodePaths().size(), 1u);
     EXPECT_EQ(r.getCallback(), &recordA);
-}
+    EXPECT_EQ(r.hexstring(std::string("\x00\x0a\xa0\xff\x5c", 5)) + r.hexstring(""), "000aa0ff5c");
 
-TEST(AlertRegisterSets, TestCleanOnlySucceedsWhenAllThreeSetsAreEmpty)
-{
-    AlertRegister bySensor(recordA, &gCtx1, 1), byClass(recordA, &gCtx1, 1),
-        byPath(recordA, &gCtx1, 1);
+    // testClean only succeeds when all three sets are empty, and then drops
+    // the callback.
+    AlertRegister bySensor(recordA, &gCtx1, 1), byClass(recordA, &gCtx1, 1), byPath(recordA, &gCtx1, 1),
+        empty(recordA, &gCtx1, 1);
     bySensor.add(recordA, ST::CPU);
     byClass.add(recordA, cls(0));
     byPath.add(recordA, Paths{"x"});
-    for (AlertRegister* r : {&bySensor, &byClass, &byPath}) {
-        EXPECT_FALSE(r->testClean());
-        EXPECT_EQ(r->getCallback(), &recordA);
-    }
-    AlertRegister empty(recordA, &gCtx1, 1);
-    EXPECT_TRUE(empty.testClean());
+    for (AlertRegister* h : {&bySensor, &byClass, &byPath})
+        EXPECT_TRUE(!h->testClean() && h->getCallback() == &recordA);
+    EXPECT_TRUE(empty.testClean() && empty.testClean());
     EXPECT_EQ(empty.getCallback(), nullptr);
-    EXPECT_TRUE(empty.testClean());
 }
 
-TEST(AlertRegisterDel, SensorAndClassRemovalReportWhetherAnythingIsLeft)
+TEST(AlertRegisterDel, RemovalReportsWhetherAnythingIsLeft)
 {
     AlertRegister r(recordA, &gCtx1, 1);
     r.add(recordA, ST::CPU);
     r.add(recordA, ST::Fan);
     r.add(recordA, cls(2));
+    r.add(recordA, Paths{"a", "b", "c"});
     ictest::LogCapture cap;
     EXPECT_EQ(r.del(recordA, ST::CPU), 0);
     EXPECT_EQ(r.getSensorTypes(), std::set<ST>{ST::Fan});
-    EXPECT_EQ(r.del(recordA, ST::Fan), 0) << "the class is still held";
-    EXPECT_EQ(r.getCallback(), &recordA);
-    EXPECT_EQ(r.del(recordA, cls(2)), 1);
-    EXPECT_TRUE(r.getClasses().empty());
-    EXPECT_EQ(r.getCallback(), nullptr) << "an emptied register drops its callback";
-    EXPECT_TRUE(cap.records().empty()) << "successful removals log nothing";
-}
-
-TEST(AlertRegisterDel, RemovingAnUnregisteredValueIsNotAnError)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, ST::CPU);
-    EXPECT_EQ(r.del(recordA, ST::Fan), 0);
-    EXPECT_EQ(r.del(recordA, cls(3)), 0);
-    EXPECT_EQ(r.del(recordA, Paths{"nope"}), 0);
-    EXPECT_EQ(r.getSensorTypes().size(), 1u);
-
-    AlertRegister empty(recordA, &gCtx1, 1);
-    EXPECT_EQ(empty.del(recordA, ST::Fan), 1);
-}
-
-TEST(AlertRegisterDel, PathListRemovesEachPath)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, Paths{"a", "b", "c"});
+    // Values never registered, and an empty path list, remove nothing.
+    EXPECT_EQ(r.del(recordA, ST::PowerSupply) + r.del(recordA, cls(3)) + r.del(recordA, Paths{}), 0);
     EXPECT_EQ(r.del(recordA, Paths{"a", "c", "zz"}), 0);
     EXPECT_EQ(r.getNodePaths(), std::set<std::string>{"b"});
+    EXPECT_EQ(r.del(recordA, ST::Fan), 0);
+    EXPECT_EQ(r.del(recordA, cls(2)), 0) << "a path is still held";
+    EXPECT_EQ(r.getCallback(), &recordA);
     EXPECT_EQ(r.del(recordA, Paths{"b"}), 1);
-    EXPECT_EQ(r.getCallback(), nullptr);
+    EXPECT_EQ(r.getCallback(), nullptr) << "an emptied register drops its callback";
+    EXPECT_TRUE(cap.records().empty()) << "successful removals log nothing";
+    for (int form = 0; form < 3; ++form) {
+        AlertRegister empty(recordA, &gCtx1, 1), holdsClass(recordA, &gCtx1, 1);
+        holdsClass.add(recordA, cls(1));
+        EXPECT_EQ(form == 0   ? empty.del(recordA, ST::Fan)
+                  : form == 1 ? empty.del(recordA, cls(1)) : empty.del(recordA, Paths{}),
+                  1);
+        EXPECT_EQ(form == 0 ? holdsClass.del(recordA, ST::Fan)
+                            : form == 1 ? holdsClass.del(recordA, cls(3)) : holdsClass.del(recordA, Paths{}),
+                  0);
+        EXPECT_TRUE(empty.getCallback() == nullptr && holdsClass.getClasses().size() == 1u) << form;
+    }
 }
 
-TEST(AlertRegisterDel, EmptyPathListOnlyTestsForEmptiness)
-{
-    AlertRegister holdsClass(recordA, &gCtx1, 1);
-    holdsClass.add(recordA, cls(1));
-    EXPECT_EQ(holdsClass.del(recordA, Paths{}), 0);
-    EXPECT_EQ(holdsClass.getClasses().size(), 1u);
-    EXPECT_EQ(holdsClass.getCallback(), &recordA);
-
-    AlertRegister empty(recordA, &gCtx1, 1);
-    EXPECT_EQ(empty.del(recordA, Paths{}), 1);
-    EXPECT_EQ(empty.getCallback(), nullptr);
-}
-
-TEST(AlertRegisterDel, OtherCallbackIsRefusedAndLogged)
+TEST(AlertRegisterDel, AnotherCallbackIsRefusedAndLogged)
 {
     AlertRegister r(recordA, &gCtx2, 1);
     r.add(recordA, ST::CPU);
     r.add(recordA, cls(6));
     r.add(recordA, Paths{"p"});
-    std::string const head = "del: " + addr(&r) + " Callback mismatch: ";
-    std::string const ctx = addr(&gCtx2);
-
+    std::string const head = "del: " + ictest::ptrText(&r) + " Callback mismatch: ";
+    std::string const ctx = ictest::ptrText(&gCtx2);
     ictest::LogCapture cap;
     EXPECT_EQ(r.del(recordB, ST::CPU), 2);
-    expectEvent(cap, head + "1 != 1 p=" + ctx, 6000, "del");
-    cap.clear();
+    ictest::expectEvent(cap, kAR, head + "1 != 1 p=" + ctx, 6000, "del");
     EXPECT_EQ(r.del(nullptr, cls(6)), 2);
-    expectEvent(cap, head + "0 != 1 p=" + ctx, 6000, "del");
-    cap.clear();
+    ictest::expectEvent(cap, kAR, head + "0 != 1 p=" + ctx, 6000, "del");
     // The path form writes its pieces in another order.
     EXPECT_EQ(r.del(recordB, Paths{"p"}), 2);
-    expectEvent(cap, head + "1 p=" + ctx + " != 1", 6000, "del");
-
-    EXPECT_EQ(r.getSensorTypes().size(), 1u);
-    EXPECT_EQ(r.getClasses().size(), 1u);
-    EXPECT_EQ(r.getNodePaths().size(), 1u);
+    ictest::expectEvent(cap, kAR, head + "1 p=" + ctx + " != 1", 6000, "del");
+    EXPECT_EQ(r.getSensorTypes().size() + r.getClasses().size() + r.getNodePaths().size(), 3u);
     EXPECT_EQ(r.getCallback(), &recordA);
-}
-
-TEST(AlertRegisterDel, EmptiedRegisterRefusesItsFormerCallback)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, ST::CPU);
-    ASSERT_EQ(r.del(recordA, ST::CPU), 1);
-    std::string const head = "del: " + addr(&r) + " Callback mismatch: ";
-    ictest::LogCapture cap;
-    EXPECT_EQ(r.del(recordA, ST::CPU), 2);
-    EXPECT_EQ(r.del(recordA, Paths{"p"}), 2);
-    EXPECT_EQ(cap.messages(), (std::vector<std::string>{head + "1 != 0 p=" + addr(&gCtx1),
-                                                        head + "1 p=" + addr(&gCtx1) + " != 0"}));
-}
-
-TEST(AlertRegisterSets, HexstringIsLowerCaseTwoDigitsPerByte)
-{
-    AlertRegister r(recordA, nullptr, 1);
-    EXPECT_EQ(r.hexstring(""), "");
-    EXPECT_EQ(r.hexstring(std::string("\x00\x0a\xa0\xff\x5c", 5)), "000aa0ff5c");
+    // An emptied register refuses its former callback.
+    ASSERT_EQ(r.del(recordA, ST::CPU) + r.del(recordA, cls(6)) + r.del(recordA, Paths{"p"}), 1);
+    cap.clear();
+    EXPECT_EQ(r.del(recordA, ST::CPU) + r.del(recordA, Paths{"p"}), 4);
+    EXPECT_EQ(cap.messages(), (Strings{head + "1 != 0 p=" + ctx, head + "1 p=" + ctx + " != 0"}));
 }
 
 // ---------------------------------------------------------------------------
-// Filtering a batch
+// Filtering a batch, and delivering it
 // ---------------------------------------------------------------------------
 
-TEST_F(AlertRegisterFilters, ClientRegisterTakesNothingFromManagementBatches)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, ST::CPU);
-    r.add(recordA, cls(7));
-    ictest::LogCapture cap;
-    EXPECT_TRUE(filter(r, {alert(7, {P0})}, kMI).empty());
-    EXPECT_TRUE(cap.records().empty());
-    EXPECT_EQ(filter(r, {alert(7, {P0})}, kFP).size(), 1u);
-}
-
-TEST_F(AlertRegisterFilters, PlugInRegisterTakesBothKindsOfBatch)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, ST::CPU);
-    for (unsigned int type : {kFP, kMI}) {
-        auto const calls = filter(r, {alert(0, {P0})}, type);
-        ASSERT_EQ(calls.size(), 1u) << type;
-        ASSERT_EQ(calls[0].getAlerts().size(), 1u);
-        EXPECT_EQ(calls[0].getAlerts()[0].getNodePaths(), Paths{P0});
+// A small tree: ROOT <- CPU 0, CPU 1, Fan 0, in a store of the test's own.
+class AlertRegisterFilters : public testing::Test {
+protected:
+    void SetUp() override
+    {
+        gDeliveries.clear();
+        gWatched = nullptr;
     }
-}
+    // Filters one batch through r; expects false and returns the calls added.
+    std::vector<AlertCall> filter(AlertRegister& r, std::vector<Alert> const& batch, unsigned int type)
+    {
+        std::vector<AlertCall> calls;
+        EXPECT_FALSE(r.filterAlerts(store, batch, calls, type));
+        return calls;
+    }
+    IC::NodeStore store;
+    ictest::NodeTree tree{store, 2, 1};
+    std::string const P0 = tree.cpu[0], P1 = tree.cpu[1], PF = tree.fan[0];
+    std::string const unknown = std::string("\x7e\x7f\x01", 3);
+};
 
-TEST_F(AlertRegisterFilters, NullCallbackIsLoggedAndSkipped)
+TEST_F(AlertRegisterFilters, ClientRegistersTakeNothingFromManagementBatches)
 {
-    AlertRegister r(nullptr, &gCtx1, 0);
-    r.add(nullptr, ST::CPU);
-    std::vector<AlertCall> calls{AlertCall(recordB, nullptr)};
+    AlertRegister client(recordA, &gCtx1, 1), plugIn(recordA, &gCtx1, 0), nullClient(nullptr, &gCtx1, 1);
+    for (AlertRegister* r : {&client, &plugIn, &nullClient})
+        r->add(recordA, ST::CPU);
     ictest::LogCapture cap;
-    EXPECT_FALSE(r.filterAlerts(store, {alert(0, {P0})}, calls, kFP));
+    EXPECT_TRUE(filter(client, {alert(7, {P0})}, kMI).empty());
+    EXPECT_TRUE(filter(nullClient, {alert(0, {P0})}, kMI).empty());
+    EXPECT_TRUE(cap.records().empty());
+    for (unsigned int type : {kFP, kMI})
+        EXPECT_EQ(ictest::sigs(filter(plugIn, {alert(0, {P0})}, type).at(0).getAlerts()),
+                  Strings{"3/0/2/m/" + ictest::hex(P0) + ","});
+    EXPECT_EQ(filter(client, {alert(7, {P0})}, kFP).size(), 1u);
+
+    // A register without a callback is logged and skipped.
+    AlertRegister null(nullptr, &gCtx1, 0);
+    null.add(nullptr, ST::CPU);
+    std::vector<AlertCall> calls{AlertCall(recordB, nullptr)};
+    cap.clear();
+    EXPECT_FALSE(null.filterAlerts(store, {alert(0, {P0})}, calls, kFP));
     EXPECT_EQ(calls.size(), 1u);
-    expectEvent(cap, "filterAlerts: Alert Register has null callback address", 6000,
-                "filterAlerts");
+    ictest::expectEvent(cap, kAR, "filterAlerts: Alert Register has null callback address", 6000, "filterAlerts");
     EXPECT_EQ(cap.logs().size(), 1u);
 }
 
-TEST_F(AlertRegisterFilters, ClientRegisterWithNullCallbackIsSilentForManagementBatches)
+TEST_F(AlertRegisterFilters, EachAlertIsCopiedWithTheMatchingPathsInOneAppendedCall)
 {
-    AlertRegister r(nullptr, &gCtx1, 1);
-    r.add(nullptr, ST::CPU);
-    ictest::LogCapture cap;
-    EXPECT_TRUE(filter(r, {alert(0, {P0})}, kMI).empty());
-    EXPECT_TRUE(cap.records().empty());
-}
-
-TEST_F(AlertRegisterFilters, CallCarriesTheRegistersCallbackAndContext)
-{
-    AlertRegister r(recordB, &gCtx2, 0);
+    AlertRegister r(recordB, &gCtx2, 1);
+    r.add(recordB, cls(8));
+    r.add(recordB, Paths{P1});
     r.add(recordB, ST::Fan);
-    std::vector<AlertCall> calls{AlertCall(recordA, &gCtx1)};
-    r.filterAlerts(store, {alert(0, {PF})}, calls, kFP);
-    ASSERT_EQ(calls.size(), 2u) << "appended after what the vector held";
-    EXPECT_EQ(calls[0].getCallback(), &recordA);
-    EXPECT_EQ(calls[1].getCallback(), &recordB);
-    EXPECT_EQ(calls[1].getContext(), &gCtx2);
-}
-
-TEST_F(AlertRegisterFilters, ClassMatchTakesEveryPathWithoutLookingThemUp)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, cls(8));
-    Alert const in = alert(8, {PF, unknown, P0}, 5, "all", 9);
-    ictest::LogCapture cap;
-    auto const calls = filter(r, {in}, kFP);
-    ASSERT_EQ(calls.size(), 1u);
-    ASSERT_EQ(calls[0].getAlerts().size(), 1u);
-    Alert const& out = calls[0].getAlerts()[0];
-    EXPECT_EQ(out.getNodePaths(), (Paths{PF, unknown, P0}));
-    EXPECT_EQ(out.getClass(), cls(8));
-    EXPECT_EQ(out.getStatus(), 5u);
-    EXPECT_EQ(out.getSeverity(), 9);
-    EXPECT_EQ(out.getMessage(), "all");
-    EXPECT_EQ(countPrefix(cap, "filterAlerts: could not find"), 0u);
-}
-
-TEST_F(AlertRegisterFilters, PathAndSensorMatchesKeepOnlyMatchingPathsInAlertOrder)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, Paths{P1});
-    r.add(recordA, ST::Fan);
-    Alert const in = alert(0, {PF, P0, P1}, 2, "mixed", 4);
+    Alert const all = alert(8, {PF, unknown, P0}, 5, "all", 9), mixed = alert(0, {PF, P0, P1}, 2, "mixed", 4);
     std::this_thread::sleep_for(std::chrono::milliseconds(2));
-    auto const calls = filter(r, {in}, kFP);
-    ASSERT_EQ(calls.size(), 1u);
-    ASSERT_EQ(calls[0].getAlerts().size(), 1u);
-    Alert const& out = calls[0].getAlerts()[0];
-    EXPECT_EQ(out.getNodePaths(), (Paths{PF, P1}));
-    EXPECT_EQ(out.getMessage(), "mixed");
-    EXPECT_EQ(out.getSeverity(), 4);
-    EXPECT_EQ(out.getStatus(), 2u);
-    EXPECT_GT(out.getTimeStamp(), in.getTimeStamp()) << "the copy is a new alert";
-}
+    std::vector<AlertCall> calls{AlertCall(recordA, &gCtx1)};
+    r.filterAlerts(store, {all, alert(0, {P0}), mixed}, calls, kFP);
+    ASSERT_EQ(calls.size(), 2u) << "appended after what the vector held";
+    EXPECT_TRUE(calls[0].getCallback() == &recordA && calls[1].getCallback() == &recordB);
+    EXPECT_EQ(calls[1].getContext(), &gCtx2);
+    // A class match takes every path without looking it up.
+    std::string const h0 = ictest::hex(P0), h1 = ictest::hex(P1), hf = ictest::hex(PF);
+    EXPECT_EQ(ictest::sigs(calls[1].getAlerts()),
+              (Strings{"9/8/5/all/" + hf + "," + ictest::hex(unknown) + "," + h0 + ",",
+                       "4/0/2/mixed/" + hf + "," + h1 + ","}));
+    EXPECT_GT(calls[1].getAlerts()[1].getTimeStamp(), mixed.getTimeStamp()) << "the copy is a new alert";
 
-TEST_F(AlertRegisterFilters, RegisteredPathMatchesEvenWhenTheStoreDoesNotKnowIt)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, Paths{unknown});
+    // A register of paths alone takes the same whether or not its lines are
+    // logged, and a path it holds matches even when the store does not know
+    // it.
+    AlertRegister byPath(recordA, &gCtx1, 0);
+    byPath.add(recordA, Paths{P0, PF});
+    std::vector<Alert> const batch{alert(0, {P1, PF, P0}, 2, "one"), alert(0, {P1}, 2, "none"),
+                                   alert(0, {P0}, 2, "two")};
+    Strings const want{"3/0/2/one/" + hf + "," + h0 + ",", "3/0/2/two/" + h0 + ","};
+    EXPECT_EQ(ictest::sigs(filter(byPath, batch, kFP).at(0).getAlerts()), want);
     ictest::LogCapture cap;
-    auto const calls = filter(r, {alert(0, {unknown})}, kFP);
-    ASSERT_EQ(calls.size(), 1u);
-    ASSERT_EQ(calls[0].getAlerts().size(), 1u);
-    EXPECT_EQ(calls[0].getAlerts()[0].getNodePaths(), Paths{unknown});
-    EXPECT_EQ(countPrefix(cap, "filterAlerts: could not find"), 0u);
-}
-
-TEST_F(AlertRegisterFilters, UnknownPathIsLoggedAndSkippedEvenForSensor74)
-{
-    AlertRegister r(recordA, &gCtx1, 1);
-    r.add(recordA, ST::invalid);
-    r.add(recordA, ST::CPU);
-    ictest::LogCapture cap;
-    auto const calls = filter(r, {alert(0, {unknown, P0})}, kFP);
-    expectEvent(cap,
-                "filterAlerts: could not find nodepath for NodePath=" + hex(unknown) +
-                    " Sensor Class=74",
-                6000, "filterAlerts");
-    ASSERT_EQ(calls.size(), 1u);
-    ASSERT_EQ(calls[0].getAlerts().size(), 1u);
-    EXPECT_EQ(calls[0].getAlerts()[0].getNodePaths(), Paths{P0});
-
-    auto const none = filter(r, {alert(0, {unknown})}, kFP);
-    ASSERT_EQ(none.size(), 1u) << "the call is made even without alerts";
-    EXPECT_TRUE(none[0].getAlerts().empty());
-}
-
-TEST_F(AlertRegisterFilters, NonMatchingBatchStillGivesOneEmptyCall)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, ST::CPU);
-    r.add(recordA, cls(2));
-    auto const calls = filter(r, {alert(0, {PF}), alert(2, {})}, kFP);
-    ASSERT_EQ(calls.size(), 1u);
-    EXPECT_TRUE(calls[0].getAlerts().empty()) << "a class match without paths adds nothing";
-}
-
-TEST_F(AlertRegisterFilters, AlertsOfOneBatchKeepTheirOrderInOneCall)
-{
-    AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, ST::CPU);
-    auto const calls =
-        filter(r, {alert(0, {P1}, 2, "first"), alert(0, {PF}, 2, "skipped"),
-                   alert(0, {P0}, 2, "second"), alert(0, {P0, P1}, 2, "third")},
-               kFP);
-    ASSERT_EQ(calls.size(), 1u);
-    auto const& got = calls[0].getAlerts();
-    ASSERT_EQ(got.size(), 3u);
-    EXPECT_EQ(got[0].getMessage(), "first");
-    EXPECT_EQ(got[1].getMessage(), "second");
-    EXPECT_EQ(got[2].getMessage(), "third");
-    EXPECT_EQ(got[2].getNodePaths(), (Paths{P0, P1}));
+    EXPECT_EQ(ictest::sigs(filter(byPath, batch, kFP).at(0).getAlerts()), want);
+    byPath.add(recordA, Paths{unknown});
+    cap.clear();
+    EXPECT_EQ(filter(byPath, {alert(0, {unknown})}, kFP).at(0).getAlerts().size(), 1u);
+    for (auto const& l : cap.logs())
+        EXPECT_EQ(l.level, 3000) << l.message;
+    // Without a match, and for a class match without paths, the call is
+    // still made, without alerts.
+    EXPECT_TRUE(filter(r, {alert(0, {P0}), alert(8, {})}, kFP).at(0).getAlerts().empty());
 }
 
 TEST_F(AlertRegisterFilters, EachInputIsLoggedAndEachTakenAlertAsItCameIn)
 {
     AlertRegister r(recordA, &gCtx1, 0);
-    r.add(recordA, Paths{P0});
-    Alert const taken = alert(0, {P0, P1}, 2, "taken");
-    Alert const left = alert(0, {PF}, 2, "left");
+    r.add(recordA, ST::CPU);
+    Alert const first = alert(0, {P1, PF}, 2, "first"), skipped = alert(0, {PF}, 2, "skipped"),
+                second = alert(0, {P0}, 2, "second");
     ictest::LogCapture cap;
-    filter(r, {taken, left}, kFP);
+    auto const calls = filter(r, {first, skipped, second}, kFP);
+    ASSERT_EQ(calls.size(), 1u);
     std::string const in = "AlertRegister::filterAlerts Input Alert=";
     std::string const out = "AlertRegister::filterAlerts output Alert=";
-    EXPECT_EQ(cap.messages(),
-              (std::vector<std::string>{in + static_cast<std::string>(taken),
-                                        out + static_cast<std::string>(taken),
-                                        in + static_cast<std::string>(left)}));
-    for (auto const& rec : cap.logs()) {
-        EXPECT_EQ(rec.level, 3000);
-        EXPECT_EQ(rec.logger, kLogger);
-        EXPECT_EQ(rec.function, "filterAlerts");
-    }
+    auto text = [](Alert const& a) { return static_cast<std::string>(a); };
+    EXPECT_EQ(cap.messages(), (Strings{in + text(first), out + text(first), in + text(skipped), in + text(second),
+                                       out + text(second)}));
+    ictest::expectEvent(cap, kAR, in + text(skipped), 3000, "filterAlerts");
+    ictest::expectEvent(cap, kAR, out + text(second), 3000, "filterAlerts");
 }
 
-// ---------------------------------------------------------------------------
-// One pending delivery
-// ---------------------------------------------------------------------------
-
-TEST_F(AlertCallTest, StartsEmptyAndAddsRestrictedCopies)
-{
-    AlertCall call(recordA, &gCtx1);
-    EXPECT_EQ(call.getCallback(), &recordA);
-    EXPECT_EQ(call.getContext(), &gCtx1);
-    EXPECT_TRUE(call.getAlerts().empty());
-
-    Alert const in = alert(5, {P0, P1, PF}, 3, "source", 7);
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-    Paths only{PF, P0};
-    call.add(in, only);
-    ASSERT_EQ(call.getAlerts().size(), 1u);
-    Alert const& out = call.getAlerts()[0];
-    EXPECT_EQ(out.getNodePaths(), (Paths{PF, P0}));
-    EXPECT_EQ(out.getSeverity(), 7);
-    EXPECT_EQ(out.getClass(), cls(5));
-    EXPECT_EQ(out.getStatus(), 3u);
-    EXPECT_EQ(out.getMessage(), "source");
-    EXPECT_GT(out.getTimeStamp(), in.getTimeStamp());
-}
-
-TEST_F(AlertCallTest, CallBackRecordsFirstThenDelivers)
+TEST_F(AlertRegisterFilters, ACallAddsRestrictedCopiesAndRecordsPlugInBatchesBeforeDelivering)
 {
     IC::AlertStore local;
     gWatched = &local;
     AlertCall call(recordA, &gCtx2);
-    Paths a{P0}, b{PF};
-    call.add(alert(0, {P0}, 2, "one"), a);
+    EXPECT_TRUE(call.getCallback() == &recordA && call.getContext() == &gCtx2 && call.getAlerts().empty());
+    Alert const in = alert(5, {P0, P1, PF}, 3, "one", 7);
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    Paths a{PF, P0}, b{PF};
+    call.add(in, a);
     call.add(alert(0, {PF}, 0, "two"), b);
-    call.callBack(local, kFP);
-
-    ASSERT_EQ(gDeliveries.size(), 1u);
-    EXPECT_EQ(gDeliveries[0].context, &gCtx2);
-    EXPECT_EQ(gDeliveries[0].storedAtCall, 2u) << "the store is updated before the call";
-    ASSERT_EQ(gDeliveries[0].alerts.size(), 2u);
-    EXPECT_EQ(gDeliveries[0].alerts[0].getMessage(), "one");
-    EXPECT_EQ(gDeliveries[0].alerts[1].getMessage(), "two");
-    EXPECT_EQ(gDeliveries[0].alerts[0].getTimeStamp(), call.getAlerts()[0].getTimeStamp());
-    std::vector<Alert> stored;
-    local.getAsserted(stored);
-    EXPECT_EQ(stored.size(), 2u);
-}
-
-TEST_F(AlertCallTest, ManagementBatchIsDeliveredButNotRecorded)
-{
-    IC::AlertStore local;
-    gWatched = &local;
-    AlertCall call(recordA, &gCtx1);
-    Paths a{P0};
-    call.add(alert(0, {P0}, 2), a);
+    EXPECT_EQ(ictest::sigs(call.getAlerts()), (Strings{"7/5/3/one/" + ictest::hex(PF) + "," + ictest::hex(P0) + ",",
+                                                       "3/0/0/two/" + ictest::hex(PF) + ","}));
+    EXPECT_GT(call.getAlerts()[0].getTimeStamp(), in.getTimeStamp());
     call.callBack(local, kMI);
-    ASSERT_EQ(gDeliveries.size(), 1u);
-    EXPECT_EQ(gDeliveries[0].alerts.size(), 1u);
-    std::vector<Alert> stored;
-    local.getAsserted(stored);
-    EXPECT_TRUE(stored.empty());
+    call.callBack(local, kFP);
+    AlertCall(recordB, &gCtx1).callBack(local, kFP);
+    gWatched = nullptr;
+    ASSERT_EQ(gDeliveries.size(), 3u);
+    EXPECT_EQ(gDeliveries[0].storedAtCall, 0u) << "a management batch is not recorded";
+    EXPECT_EQ(gDeliveries[1].storedAtCall, 2u) << "the store is updated before the call";
+    EXPECT_EQ(gDeliveries[1].context, &gCtx2);
+    EXPECT_EQ(ictest::sigs(gDeliveries[1].alerts), ictest::sigs(call.getAlerts()));
+    EXPECT_EQ(gDeliveries[1].alerts[0].getTimeStamp(), call.getAlerts()[0].getTimeStamp());
+    // A call without alerts still calls back and clears nothing.
+    EXPECT_TRUE(gDeliveries[2].alerts.empty());
+    EXPECT_EQ(gDeliveries[2].context, &gCtx1);
+    EXPECT_EQ(gDeliveries[2].storedAtCall, 2u);
 }
 
-TEST_F(AlertCallTest, CallWithoutAlertsStillCallsBackAndClearsNothing)
-{
-    IC::AlertStore local;
-    local.newAlerts({alert(0, {P0}, 2)}, kFP);
-    AlertCall call(recordB, &gCtx1);
-    call.callBack(local, kFP);
-    ASSERT_EQ(gDeliveries.size(), 1u);
-    EXPECT_TRUE(gDeliveries[0].alerts.empty());
-    EXPECT_EQ(gDeliveries[0].context, &gCtx1);
-    std::vector<Alert> stored;
-    local.getAsserted(stored);
-    EXPECT_EQ(stored.size(), 1u);
-}
+} // namespace

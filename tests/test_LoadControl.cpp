@@ -8,199 +8,130 @@
 
 #include "PluginTest.h"
 
-#include <gtest/gtest.h>
-
-#include <fstream>
-#include <set>
-#include <string>
-#include <vector>
-
 #include <sys/stat.h>
 #include <unistd.h>
 
 namespace {
 
-using ictest::countLog;
 using ictest::kLogLC;
 using ictest::ptrText;
 
 std::string const kLooking = "findLibs: Looking for directory ";
 std::string const kOpened = "findLibs: Opened Lib Opened with filehandle ";
 
-void closeAll(std::vector<IC::libstruct>& libs)
-{
-    for (auto& r : libs)
-        SD::PlatformUtilities::unloadLibrary(r.handle);
-    libs.clear();
-}
-
 class FindLibs : public testing::Test {
 protected:
     void SetUp() override { ictestprobe::reset(); }
-    void TearDown() override { closeAll(libs_); }
-
-    std::string dir() const { return tree_.miDir(); }
+    void TearDown() override
+    {
+        for (auto& r : libs_)
+            SD::PlatformUtilities::unloadLibrary(r.handle);
+    }
+    IC::Error find(std::string const& dir)
+    {
+        std::set<std::string> names{"kept"};
+        IC::Error const e = IC::LoadControl().findLibs(dir, libs_, names);
+        EXPECT_EQ(names, std::set<std::string>{"kept"}) << "names is not used";
+        return e;
+    }
 
     ictest::TempTree tree_;
+    std::string const dir_ = tree_.miDir();
     std::vector<IC::libstruct> libs_;
 };
 
-TEST_F(FindLibs, RecordsEveryLibraryThatOpensInTheDirectorysOrder)
+TEST_F(FindLibs, AppendsARecordForEveryLibraryThatOpensInTheDirectorysOrder)
 {
-    tree_.install(dir(), "mi_alpha", "b.so");
-    tree_.install(dir(), "mi_beta", "a.so");
-    tree_.install(dir(), "fp_one", "c.so");
-    { std::ofstream(dir() + "/readme.txt") << "not a plug-in"; }
-
-    std::set<std::string> names{"kept"};
-    ictest::LogCapture cap;
-    IC::Error const e = IC::LoadControl().findLibs(dir(), libs_, names);
-
-    EXPECT_EQ(e.getStatus(), 0);
-    EXPECT_EQ(e.getCode(), IC::Number(IC::Number::Generic));
-    EXPECT_EQ(e.getText(), "");
-    EXPECT_EQ(names, (std::set<std::string>{"kept"}));
-
-    // Discovery keeps the reader's order; it does not sort by itself.
-    SD::DirectoryReader reader(dir().c_str(), ".so");
-    ASSERT_EQ(reader.getNumberOfFiles(), 3);
-    ASSERT_EQ(libs_.size(), 3u);
-    for (int i = 0; i < 3; ++i) {
-        std::string const path = reader.getFileName(i);
-        IC::libstruct const& r = libs_[static_cast<std::size_t>(i)];
-        EXPECT_NE(r.handle, nullptr);
-        EXPECT_EQ(r.path, path);
-        EXPECT_EQ(r.name, path.substr(dir().size() + 1));
-        EXPECT_EQ(r.plugin, nullptr);
-        EXPECT_EQ(r.idbase, 0u);
-        EXPECT_EQ(countLog(cap, kLogLC, 3000, kOpened + ptrText(r.handle) + " for file " + path), 1u)
-            << path;
-    }
-    EXPECT_EQ(libs_[0].name, "a.so");
-    EXPECT_EQ(libs_[1].name, "b.so");
-    EXPECT_EQ(libs_[2].name, "c.so");
-
-    // Opened, not only listed: the images are mapped and their static
-    // initialisation ran.
-    EXPECT_EQ(ictestprobe::liveImages(), 3);
-    EXPECT_TRUE(ictest::isMapped(dir() + "/a.so"));
-
-    auto const logs = ictest::logsOf(cap, kLogLC);
-    ASSERT_EQ(logs.size(), 4u);
-    EXPECT_EQ(logs[0].message, kLooking + dir());
-    EXPECT_EQ(logs[0].level, 3000);
-    for (auto const& r : logs) {
-        EXPECT_EQ(r.function, "findLibs");
-        EXPECT_EQ(r.file, "LoadControl");
-    }
-    // Each event went to both channels.
-    std::size_t trace = 0;
-    for (auto const& r : cap.records())
-        if (r.channel == HGLog::Channel::Trace && r.logger == kLogLC)
-            ++trace;
-    EXPECT_EQ(trace, 4u);
-}
-
-TEST_F(FindLibs, AppendsWithoutTouchingWhatTheListHeld)
-{
-    tree_.install(dir(), "mi_alpha");
+    tree_.install(dir_, "mi_alpha", "b.so");
+    tree_.install(dir_, "mi_beta", "a.so");
+    tree_.install(dir_, "fp_one", "c.so");
+    tree_.write("mi/readme.txt", "not a plug-in");
+    tree_.write("mi/lib.so.1", "x");
     IC::libstruct earlier;
     earlier.path = "/elsewhere/earlier.so";
     earlier.name = "earlier.so";
     earlier.idbase = 0x50000;
-    std::vector<IC::libstruct> libs{earlier};
-    std::set<std::string> names;
-    EXPECT_EQ(IC::LoadControl().findLibs(dir(), libs, names).getStatus(), 0);
-    ASSERT_EQ(libs.size(), 2u);
-    EXPECT_EQ(libs[0].name, "earlier.so");
-    EXPECT_EQ(libs[0].idbase, 0x50000u);
-    EXPECT_EQ(libs[0].handle, nullptr);
-    EXPECT_EQ(libs[1].name, "mi_alpha.so");
-    libs_.push_back(libs[1]);
+    libs_.push_back(earlier);
+
+    ictest::LogCapture cap;
+    ictest::expectError(find(dir_), 0);
+    ASSERT_EQ(libs_.size(), 4u);
+    EXPECT_EQ(libs_[0].name, "earlier.so");
+    EXPECT_EQ(libs_[0].idbase, 0x50000u);
+    EXPECT_EQ(libs_[0].handle, nullptr);
+    // Discovery keeps the reader's order; it does not sort by itself.
+    SD::DirectoryReader reader(dir_.c_str(), ".so");
+    ASSERT_EQ(reader.getNumberOfFiles(), 3);
+    std::vector<std::string> want{kLooking + dir_};
+    for (int i = 0; i < 3; ++i) {
+        std::string const path = reader.getFileName(i);
+        IC::libstruct const& r = libs_[static_cast<std::size_t>(i) + 1];
+        EXPECT_NE(r.handle, nullptr);
+        EXPECT_EQ(r.path, path);
+        EXPECT_EQ(r.name, std::string(1, static_cast<char>('a' + i)) + ".so");
+        EXPECT_EQ(r.plugin, nullptr);
+        EXPECT_EQ(r.idbase, 0u);
+        want.push_back(kOpened + ptrText(r.handle) + " for file " + path);
+    }
+    // Opened, not only listed: the images are mapped and their static
+    // initialisation ran.
+    EXPECT_EQ(ictestprobe::liveImages(), 3);
+    EXPECT_TRUE(ictest::isMapped(dir_ + "/a.so"));
+    EXPECT_EQ(cap.messages(kLogLC), want);
+    for (auto const& m : want)
+        ictest::expectEvent(cap, {kLogLC, "LoadControl"}, m, 3000, "findLibs");
 }
 
 TEST_F(FindLibs, AFileThatDoesNotOpenIsLoggedWithANullHandleAndLeftOut)
 {
-    std::string const text = dir() + "/broken.so";
-    { std::ofstream(text) << "this is not an ELF file"; }
-    std::string const subdir = dir() + "/directory.so";
+    std::string const text = tree_.write("mi/broken.so", "this is not an ELF file");
+    std::string const subdir = dir_ + "/directory.so";
     ASSERT_EQ(mkdir(subdir.c_str(), 0700), 0);
-    std::string const dangling = dir() + "/dangling.so";
-    ASSERT_EQ(symlink((dir() + "/nowhere").c_str(), dangling.c_str()), 0);
-    std::string const good = tree_.install(dir(), "mi_alpha", "good.so");
-    std::string const link = dir() + "/link.so";
+    std::string const dangling = dir_ + "/dangling.so", link = dir_ + "/link.so";
+    ASSERT_EQ(symlink((dir_ + "/nowhere").c_str(), dangling.c_str()), 0);
+    std::string const good = tree_.install(dir_, "mi_alpha", "good.so");
     ASSERT_EQ(symlink(good.c_str(), link.c_str()), 0);
 
-    std::set<std::string> names;
     ictest::LogCapture cap;
-    EXPECT_EQ(IC::LoadControl().findLibs(dir(), libs_, names).getStatus(), 0);
-
-    std::string const null = ptrText(nullptr);
+    ictest::expectError(find(dir_), 0);
     for (auto const& p : {text, subdir, dangling})
-        EXPECT_EQ(countLog(cap, kLogLC, 3000, kOpened + null + " for file " + p), 1u) << p;
+        EXPECT_EQ(cap.count(kLogLC, 3000, kOpened + ptrText(nullptr) + " for file " + p), 1u) << p;
     // A link to a library is a library.
     ASSERT_EQ(libs_.size(), 2u);
     EXPECT_EQ(libs_[0].name, "good.so");
     EXPECT_EQ(libs_[1].name, "link.so");
     EXPECT_EQ(libs_[1].path, link);
-    for (auto const& r : libs_)
-        EXPECT_NE(r.handle, nullptr);
+    EXPECT_NE(libs_[1].handle, nullptr);
     // One line per file, nothing more: the failures are not errors of
     // discovery.
-    EXPECT_EQ(ictest::logsOf(cap, kLogLC).size(), 6u);
+    EXPECT_EQ(cap.logs(kLogLC).size(), 6u);
 }
 
 TEST_F(FindLibs, AMissingDirectoryGivesNoRecordsAndSuccess)
 {
-    std::string const missing = tree_.root() + "/no-such-directory";
-    std::set<std::string> names;
+    std::string const missing = tree_.path("no-such-directory");
     ictest::LogCapture cap;
-    IC::Error const e = IC::LoadControl().findLibs(missing, libs_, names);
-    EXPECT_EQ(e.getStatus(), 0);
-    EXPECT_EQ(e.getText(), "");
+    ictest::expectError(find(missing), 0);
     EXPECT_TRUE(libs_.empty());
-    auto const logs = ictest::logsOf(cap, kLogLC);
-    ASSERT_EQ(logs.size(), 1u);
-    EXPECT_EQ(logs[0].message, kLooking + missing);
+    EXPECT_EQ(cap.messages(kLogLC), std::vector<std::string>{kLooking + missing});
 }
 
-TEST_F(FindLibs, ADirectoryWithoutLibrariesGivesNoRecords)
+TEST_F(FindLibs, EveryScanOpensTheLibraryAgainAndATrailingSeparatorChangesNothing)
 {
-    { std::ofstream(dir() + "/notes.txt") << "x"; }
-    { std::ofstream(dir() + "/lib.so.1") << "x"; }
-    std::set<std::string> names;
-    EXPECT_EQ(IC::LoadControl().findLibs(dir(), libs_, names).getStatus(), 0);
-    EXPECT_TRUE(libs_.empty());
-}
-
-TEST_F(FindLibs, ADirectoryGivenWithATrailingSeparatorStillYieldsBareNames)
-{
-    tree_.install(dir(), "mi_alpha", "x.so");
-    std::set<std::string> names;
-    EXPECT_EQ(IC::LoadControl().findLibs(dir() + "/", libs_, names).getStatus(), 0);
-    ASSERT_EQ(libs_.size(), 1u);
-    EXPECT_EQ(libs_[0].name, "x.so");
-    EXPECT_EQ(libs_[0].path.substr(libs_[0].path.size() - 5), "/x.so");
-}
-
-TEST_F(FindLibs, EveryScanOpensTheLibraryAgain)
-{
-    tree_.install(dir(), "mi_alpha");
-    std::set<std::string> names;
-    IC::LoadControl lc;
-    lc.findLibs(dir(), libs_, names);
-    lc.findLibs(dir(), libs_, names);
+    tree_.install(dir_, "mi_alpha");
+    find(dir_);
+    find(dir_ + "/");
     ASSERT_EQ(libs_.size(), 2u);
     EXPECT_NE(libs_[0].handle, libs_[1].handle);
-    EXPECT_EQ(libs_[0].name, libs_[1].name);
+    EXPECT_EQ(libs_[1].name, "mi_alpha.so");
+    EXPECT_EQ(libs_[1].path, dir_ + "//mi_alpha.so");
     EXPECT_EQ(ictestprobe::liveImages(), 1);
-
     // One image, two references: it goes with the second close only.
     SD::PlatformUtilities::unloadLibrary(libs_[0].handle);
-    EXPECT_TRUE(ictest::isMapped(dir() + "/mi_alpha.so"));
+    EXPECT_TRUE(ictest::isMapped(dir_ + "/mi_alpha.so"));
     SD::PlatformUtilities::unloadLibrary(libs_[1].handle);
     libs_.clear();
-    EXPECT_FALSE(ictest::isMapped(dir() + "/mi_alpha.so"));
+    EXPECT_FALSE(ictest::isMapped(dir_ + "/mi_alpha.so"));
     EXPECT_EQ(ictestprobe::liveImages(), 0);
 }
 
@@ -214,47 +145,32 @@ IC::libstruct rec(std::string const& name, std::string const& path = std::string
     return r;
 }
 
-using Less = bool (*)(IC::libstruct, IC::libstruct);
-
-class LibOrder : public testing::TestWithParam<Less> {};
-
-TEST_P(LibOrder, ComparesBareNamesByteWise)
+TEST(LibOrder, BothLoadersCompareBareNamesByteWise)
 {
-    Less const lt = GetParam();
-    // First differing byte decides: '.' (0x2E) is less than 'b' (0x62).
-    EXPECT_TRUE(lt(rec("a.so"), rec("ab.so")));
-    EXPECT_FALSE(lt(rec("ab.so"), rec("a.so")));
-    // A byte-wise prefix comes first.
-    EXPECT_TRUE(lt(rec("ab"), rec("ab.so")));
-    EXPECT_FALSE(lt(rec("ab.so"), rec("ab")));
-    // Irreflexive.
-    EXPECT_FALSE(lt(rec("same.so"), rec("same.so")));
-    EXPECT_FALSE(lt(rec(""), rec("")));
-    EXPECT_TRUE(lt(rec(""), rec("a")));
-    // Unsigned bytes: above 0x7F sorts after every ASCII name.
-    EXPECT_TRUE(lt(rec("z.so"), rec("\xc3\xa9.so")));
-    EXPECT_FALSE(lt(rec("\xc3\xa9.so"), rec("z.so")));
-    EXPECT_TRUE(lt(rec("\x7f"), rec("\x80")));
-    EXPECT_TRUE(lt(rec("Z"), rec("a")));
-    // Only the name counts, not the path.
-    EXPECT_TRUE(lt(rec("a.so", "/zzz/a.so"), rec("b.so", "/aaa/b.so")));
-    EXPECT_FALSE(lt(rec("b.so", "/aaa/b.so"), rec("a.so", "/zzz/a.so")));
-    EXPECT_FALSE(lt(rec("a.so", "/one/a.so"), rec("a.so", "/two/a.so")));
-}
+    for (auto lt : {&IC::MI_CONTROL::libLT, &IC::FP_CONTROL::libLT}) {
+        // First differing byte decides ('.' is less than 'b'); a prefix comes
+        // first; bytes are unsigned; only the name counts, not the path.
+        std::pair<IC::libstruct, IC::libstruct> const ordered[] = {
+            {rec("a.so"), rec("ab.so")},        {rec("ab"), rec("ab.so")},
+            {rec(""), rec("a")},                {rec("z.so"), rec("\xc3\xa9.so")},
+            {rec("\x7f"), rec("\x80")},         {rec("Z"), rec("a")},
+            {rec("a.so", "/zzz/a.so"), rec("b.so", "/aaa/b.so")}};
+        for (auto const& p : ordered) {
+            EXPECT_TRUE(lt(p.first, p.second)) << p.first.name << " < " << p.second.name;
+            EXPECT_FALSE(lt(p.second, p.first)) << p.second.name << " < " << p.first.name;
+        }
+        for (auto const& same : {rec("same.so"), rec(""), rec("a.so", "/one/a.so")})
+            EXPECT_FALSE(lt(same, rec(same.name, "/two/" + same.name)));
 
-TEST_P(LibOrder, SortsALoadListByName)
-{
-    std::vector<IC::libstruct> v{rec("mi_b.so"), rec("\xe2\x82\xac.so"), rec("mi_a.so"),
-                                 rec("MI.so"), rec("mi_a"), rec("mi_ab.so")};
-    std::sort(v.begin(), v.end(), GetParam());
-    std::vector<std::string> names;
-    for (auto const& r : v)
-        names.push_back(r.name);
-    EXPECT_EQ(names, (std::vector<std::string>{"MI.so", "mi_a", "mi_a.so", "mi_ab.so", "mi_b.so",
-                                               "\xe2\x82\xac.so"}));
+        std::vector<IC::libstruct> v{rec("mi_b.so"), rec("\xe2\x82\xac.so"), rec("mi_a.so"),
+                                     rec("MI.so"), rec("mi_a"), rec("mi_ab.so")};
+        std::sort(v.begin(), v.end(), lt);
+        std::vector<std::string> names;
+        for (auto const& r : v)
+            names.push_back(r.name);
+        EXPECT_EQ(names, (std::vector<std::string>{"MI.so", "mi_a", "mi_a.so", "mi_ab.so",
+                                                   "mi_b.so", "\xe2\x82\xac.so"}));
+    }
 }
-
-INSTANTIATE_TEST_SUITE_P(BothLoaders, LibOrder,
-                         testing::Values(&IC::MI_CONTROL::libLT, &IC::FP_CONTROL::libLT));
 
 } // namespace

@@ -7,20 +7,10 @@
 
 #include "PluginTest.h"
 
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <chrono>
-#include <stdexcept>
-#include <string>
-#include <thread>
-#include <vector>
-
 #include <dlfcn.h>
 
 namespace {
 
-using ictest::countLog;
 using ictest::kLogIC;
 using ictest::kLogLT;
 namespace IST = IC::InstCtrl;
@@ -32,98 +22,61 @@ void count()
     ++calls;
 }
 
-void fail()
-{
-    throw std::runtime_error("reload broke");
-}
-
 std::string const kZeroDelay = "LoaderThread has zero delay. Setting 10 seconds instead";
-
-// Polls until pred holds or ms have passed.
-template <class Pred>
-bool eventually(Pred pred, int ms)
-{
-    auto const end = Clock::now() + std::chrono::milliseconds(ms);
-    while (!pred()) {
-        if (Clock::now() > end)
-            return false;
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return true;
-}
 
 class LoaderThreadAlone : public testing::Test {
 protected:
     void SetUp() override { calls = 0; }
+    ictest::Watchdog dog_{30, "loader thread test"};
 };
 
-TEST_F(LoaderThreadAlone, KeepsWhatItWasGiven)
+TEST_F(LoaderThreadAlone, AZeroDelayBecomesTenSecondsWithOneErrorLineWhenItRuns)
 {
-    IC::LoaderThread t(77, 5, &count);
-    EXPECT_EQ(t.getHostValue(), 77u);
-    EXPECT_EQ(t.getDelay(), 5u);
-    EXPECT_FALSE(t.stopped());
-}
-
-TEST_F(LoaderThreadAlone, AZeroDelayBecomesTenSecondsWithOneErrorLine)
-{
-    ictest::Watchdog dog(30, "zero delay");
     ictest::LogCapture cap;
-    IC::LoaderThread t(3, 0, &count);
-    // Corrected when the thread runs, not before.
-    EXPECT_EQ(t.getDelay(), 0u);
+    IC::LoaderThread t(77, 0, &count);
+    EXPECT_EQ(t.getHostValue(), 77u);
+    EXPECT_EQ(t.getDelay(), 0u) << "corrected when the thread runs, not before";
+    EXPECT_FALSE(t.stopped());
     ASSERT_TRUE(t.start());
-    // Give run() the chance to start before the stop request; it logs the
-    // correction either way.
-    ASSERT_TRUE(eventually([&] { return countLog(cap, kLogLT, 6000, kZeroDelay) == 1; }, 5000));
+    // The stop request waits for the correction, which is logged either way.
+    EXPECT_TRUE(ictest::eventually([&] { return cap.count(kLogLT, 6000, kZeroDelay) == 1; }));
     t.stop();
     t.join();
     EXPECT_TRUE(t.stopped());
     EXPECT_EQ(t.getDelay(), 10u);
     EXPECT_EQ(calls.load(), 0);
-    auto const logs = ictest::logsOf(cap, kLogLT);
-    ASSERT_EQ(logs.size(), 1u);
-    EXPECT_EQ(logs[0].message, kZeroDelay);
-    EXPECT_EQ(logs[0].level, 6000);
-    EXPECT_EQ(logs[0].function, "run");
-    EXPECT_EQ(logs[0].file, "LoaderThread");
+    ASSERT_EQ(cap.logs(kLogLT).size(), 1u);
+    ictest::expectEvent(cap, {kLogLT, "LoaderThread"}, kZeroDelay, 6000, "run");
 }
 
 TEST_F(LoaderThreadAlone, CallsItsFunctionEveryPeriodUntilStopped)
 {
-    ictest::Watchdog dog(30, "periodic calls");
     ictest::LogCapture cap;
     IC::LoaderThread t(0, 1, &count);
     ASSERT_TRUE(t.start());
-    EXPECT_TRUE(eventually([] { return calls.load() >= 2; }, 8000));
+    EXPECT_TRUE(ictest::eventually([] { return calls.load() >= 2; }, 8000));
     EXPECT_FALSE(t.stopped());
     t.stop();
     t.join();
     EXPECT_TRUE(t.stopped());
     int const seen = calls.load();
     std::this_thread::sleep_for(std::chrono::milliseconds(1200));
-    EXPECT_EQ(calls.load(), seen);
+    EXPECT_EQ(calls.load(), seen) << "called after it was stopped";
     EXPECT_EQ(t.getDelay(), 1u);
-    EXPECT_TRUE(ictest::logsOf(cap, kLogLT).empty());
-}
 
-TEST_F(LoaderThreadAlone, WithoutAFunctionItOnlyWaits)
-{
-    ictest::Watchdog dog(30, "null function");
-    ictest::LogCapture cap;
-    IC::LoaderThread t(0, 1, nullptr);
-    ASSERT_TRUE(t.start());
+    // Without a function it only waits.
+    IC::LoaderThread idle(0, 1, nullptr);
+    ASSERT_TRUE(idle.start());
     std::this_thread::sleep_for(std::chrono::milliseconds(1500));
-    EXPECT_FALSE(t.stopped());
-    t.stop();
-    t.join();
-    EXPECT_TRUE(t.stopped());
-    EXPECT_TRUE(ictest::logsOf(cap, kLogLT).empty());
+    EXPECT_FALSE(idle.stopped());
+    idle.stop();
+    idle.join();
+    EXPECT_TRUE(idle.stopped());
+    EXPECT_TRUE(cap.logs(kLogLT).empty());
 }
 
 TEST_F(LoaderThreadAlone, AStopWhileWaitingTakesItsSecondAndEndsTheThread)
 {
-    ictest::Watchdog dog(30, "stop while waiting");
     IC::LoaderThread t(0, 3600, &count);
     ASSERT_TRUE(t.start());
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
@@ -137,35 +90,24 @@ TEST_F(LoaderThreadAlone, AStopWhileWaitingTakesItsSecondAndEndsTheThread)
     EXPECT_EQ(calls.load(), 0);
 }
 
-TEST_F(LoaderThreadAlone, RunOnAStoppedObjectReturnsAtOnce)
+TEST_F(LoaderThreadAlone, RunOnAStoppedObjectReturnsAtOnceAndAnExceptionEndsIt)
 {
-    ictest::Watchdog dog(30, "run twice");
     IC::LoaderThread t(1, 0, &count);
     t.stop();
     ictest::LogCapture cap;
     // The stop request is already there: the first run only corrects the
-    // delay and ends.
+    // delay and ends; the second does not even do that.
     EXPECT_EQ(t.run(nullptr), nullptr);
     EXPECT_TRUE(t.stopped());
-    EXPECT_EQ(countLog(cap, kLogLT, 6000, kZeroDelay), 1u);
-    EXPECT_EQ(ictest::logsOf(cap, kLogLT).size(), 1u);
-    cap.clear();
+    EXPECT_EQ(cap.messages(kLogLT), std::vector<std::string>{kZeroDelay});
     EXPECT_EQ(t.run(nullptr), nullptr);
-    EXPECT_TRUE(t.stopped());
-    EXPECT_TRUE(ictest::logsOf(cap, kLogLT).empty());
+    EXPECT_EQ(cap.logs(kLogLT).size(), 1u);
     EXPECT_EQ(calls.load(), 0);
-}
 
-TEST_F(LoaderThreadAlone, AnExceptionFromTheFunctionEndsRun)
-{
-    ictest::Watchdog dog(30, "throwing function");
-    IC::LoaderThread t(0, 1, &fail);
-    EXPECT_THROW(t.run(nullptr), std::runtime_error);
-    // run() did not get to its end.
-    EXPECT_FALSE(t.stopped());
+    IC::LoaderThread failing(0, 1, [] { throw std::runtime_error("reload broke"); });
+    EXPECT_THROW(failing.run(nullptr), std::runtime_error);
+    EXPECT_FALSE(failing.stopped()) << "run() did not get to its end";
 }
-
-// ---- installed in the library ----
 
 // A host may derive its own loader thread from the class (or catch and cast
 // it): the type's run-time information must be part of the library's
@@ -179,6 +121,8 @@ TEST(LoaderThreadExport, ItsTypeInformationIsExported)
     dlclose(lib);
 }
 
+// ---- installed in the library ----
+
 class InstalledLoader : public ictest::PluginTest {
 protected:
     void TearDown() override
@@ -188,47 +132,48 @@ protected:
         PluginTest::TearDown();
         EXPECT_EQ(IST::lt, nullptr);
     }
-    unsigned char open()
+    static unsigned char open()
     {
         IC::InstrumentationControl* c = nullptr;
         IC::Error* e = nullptr;
         return Open(&c, &e);
     }
-    void install(unsigned long delay, void (*function)())
+    static IC::LoaderThread* install(unsigned long delay)
     {
-        auto* t = new IC::LoaderThread(0, delay, function);
+        auto* t = new IC::LoaderThread(0, delay, &IST::TimedReload);
         IST::lt = t;
-        ASSERT_TRUE(t->start());
+        EXPECT_TRUE(t->start());
+        return t;
+    }
+    // The last unload ended everything.
+    static void expectAllGone()
+    {
+        EXPECT_EQ(IST::ICloadCount, 0u);
+        EXPECT_TRUE(IST::unloaddone);
+        EXPECT_EQ(IST::lt, nullptr);
+        EXPECT_EQ(ictestprobe::liveImages(), 0);
     }
 };
 
-TEST_F(InstalledLoader, TheLastUnloadStopsJoinsAndDeletesIt)
+TEST_F(InstalledLoader, TheLastUnloadStopsJoinsAndDeletesItFirst)
 {
     ictest::Watchdog dog(30, "unload with a loader thread");
     tree_.addMI("mi_alpha");
     ASSERT_EQ(open(), 0);
     ASSERT_EQ(open(), 0);
-    install(3600, &IST::TimedReload);
-    IC::LoaderThread* const t = IST::lt;
-
+    IC::LoaderThread* const t = install(3600);
     Unloadlib();
     EXPECT_EQ(IST::lt, t);
     EXPECT_FALSE(t->stopped());
     EXPECT_TRUE(t->isRunning());
 
     ictest::LogCapture cap;
-    // Deleted by the unload (the address checker reports it otherwise).
-    Unloadlib();
-    EXPECT_EQ(IST::lt, nullptr);
-    auto const tl = ictest::timeline(cap);
-    long const waiting = ictest::indexOf(tl, "doUnload: waiting for LoaderThread Termination ");
-    long const ended = ictest::indexOf(tl, "doUnload: LoaderThread ended ");
-    long const released = ictest::indexOf(tl, "mi_alpha:release");
-    EXPECT_GE(waiting, 0);
-    EXPECT_LT(waiting, ended);
+    Unloadlib(); // deletes it (the address checker reports it otherwise)
+    expectAllGone();
     // The thread is gone before any plug-in is destroyed.
-    EXPECT_LT(ended, released);
-    EXPECT_EQ(countLog(cap, kLogIC, 3000, "doUnload: LoaderThread ended "), 1u);
+    ictest::expectInOrder(ictest::timeline(cap), {"doUnload: waiting for LoaderThread Termination ",
+                                                  "doUnload: LoaderThread ended ", "mi_alpha:release"});
+    EXPECT_EQ(cap.count(kLogIC, 3000, "doUnload: LoaderThread ended "), 1u);
 }
 
 TEST_F(InstalledLoader, ReloadsPeriodicallyWhileOpen)
@@ -237,21 +182,17 @@ TEST_F(InstalledLoader, ReloadsPeriodicallyWhileOpen)
     tree_.addMI("mi_alpha");
     tree_.addFP("fp_one");
     ASSERT_EQ(open(), 0);
-    install(1, &IST::TimedReload);
-
+    install(1);
     std::string const beta = tree_.addMI("mi_beta");
     EXPECT_TRUE(ictestprobe::waitFor("mi_beta:getMap", 10000));
     EXPECT_TRUE(ictestprobe::waitFor("fp_one:updatedMis added=1 removed=0", 10000));
-    ictest::TempTree::remove(beta);
+    ictest::fs::remove(beta);
     EXPECT_TRUE(ictestprobe::waitFor("mi_beta:release", 10000));
     EXPECT_TRUE(ictestprobe::waitFor("fp_one:updatedMis added=0 removed=1", 10000));
     tree_.addFP("fp_two");
     EXPECT_TRUE(ictestprobe::waitFor("fp_two:OpenFP", 10000));
-
     Unloadlib();
-    EXPECT_EQ(IST::lt, nullptr);
-    EXPECT_EQ(IST::ICloadCount, 0u);
-    EXPECT_EQ(ictestprobe::liveImages(), 0);
+    expectAllGone();
 }
 
 TEST_F(InstalledLoader, AnUnloadDuringASlowReloadWaitsForItAndFinishes)
@@ -259,24 +200,16 @@ TEST_F(InstalledLoader, AnUnloadDuringASlowReloadWaitsForItAndFinishes)
     ictest::Watchdog dog(30, "unload during a slow reload");
     tree_.addMI("mi_alpha");
     ASSERT_EQ(open(), 0);
-    install(1, &IST::TimedReload);
+    install(1);
     tree_.addMI("mi_slow");
     // The reload is inside the plug-in's Initialize, with the load lock held.
-    ASSERT_TRUE(eventually(
+    ASSERT_TRUE(ictest::eventually(
         [] { return !ictestprobe::eventsWithPrefix("mi_slow:Initialize base=").empty(); }, 10000));
-
     Unloadlib();
-    EXPECT_EQ(IST::ICloadCount, 0u);
-    EXPECT_TRUE(IST::unloaddone);
-    EXPECT_EQ(IST::lt, nullptr);
+    expectAllGone();
     // The load that was under way completed before the teardown.
-    auto const ev = ictestprobe::events();
-    long const slept = ictest::indexOf(ev, "mi_slow:Initialize slept");
-    long const down = ictest::indexOf(ev, "mi_slow:shutdown");
-    EXPECT_GE(slept, 0);
-    EXPECT_LT(slept, down);
+    ictest::expectInOrder(ictestprobe::events(), {"mi_slow:Initialize slept", "mi_slow:shutdown"});
     EXPECT_EQ(ictestprobe::count("mi_slow:release"), 1u);
-    EXPECT_EQ(ictestprobe::liveImages(), 0);
 }
 
 // The loader thread has woken up and waits for the load lock inside a timed
@@ -289,24 +222,18 @@ TEST_F(InstalledLoader, AnUnloadWhileTheReloadWaitsForTheLockDoesNotDeadlock)
         SCOPED_TRACE(round);
         ictest::Watchdog dog(30, "unload against a waiting reload");
         ASSERT_EQ(open(), 0);
-        install(1, &IST::TimedReload);
-
+        install(1);
         ictest::LogCapture cap;
         IST::loadlock.lock();
-        bool const waiting = eventually(
-            [&] { return countLog(cap, kLogIC, 3000, "Instrumentation Control Timed Reload") >= 1; },
-            5000);
+        bool const waiting = ictest::eventually(
+            [&] { return cap.count(kLogIC, 3000, "Instrumentation Control Timed Reload") >= 1; });
         std::thread unloader([] { Unloadlib(); });
         // Let the unload queue up for the lock as well.
         std::this_thread::sleep_for(std::chrono::milliseconds(200));
         IST::loadlock.unlock();
         unloader.join();
-
         EXPECT_TRUE(waiting);
-        EXPECT_EQ(IST::ICloadCount, 0u);
-        EXPECT_TRUE(IST::unloaddone);
-        EXPECT_EQ(IST::lt, nullptr);
-        EXPECT_EQ(ictestprobe::liveImages(), 0);
+        expectAllGone();
     }
 }
 

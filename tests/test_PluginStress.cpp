@@ -9,22 +9,13 @@
 
 #include "PluginTest.h"
 
-#include <gtest/gtest.h>
-
-#include <atomic>
-#include <chrono>
 #include <random>
-#include <string>
-#include <thread>
-#include <vector>
 
 namespace {
 
 namespace IST = IC::InstCtrl;
-using Clock = std::chrono::steady_clock;
 
 std::atomic<long> clientAlerts{0};
-std::atomic<long> simpleEvents{0};
 
 IC::Error client(std::vector<IC::Alert> const& alerts, void const*)
 {
@@ -32,10 +23,7 @@ IC::Error client(std::vector<IC::Alert> const& alerts, void const*)
     return IC::Error(0, IC::Number(IC::Number::Generic), "");
 }
 
-void simple(unsigned int, SD::DateTime, std::string, void const*)
-{
-    ++simpleEvents;
-}
+void simple(unsigned int, SD::DateTime, std::string, void const*) {}
 
 class PluginStress : public ictest::PluginTest {
 protected:
@@ -50,17 +38,13 @@ TEST_F(PluginStress, ReloadsAlertsQueriesAndRegistrationsTogether)
 {
     ictest::Watchdog dog(120, "plug-in stress");
     clientAlerts = 0;
-    simpleEvents = 0;
-
     // Plug-ins that stay for the whole run, and some that come and go.
     tree_.addMI("mi_thread", "t0.so");
     tree_.addMI("mi_alpha");
     tree_.addFP("fp_relay");
     tree_.addFP("fp_one");
     ictestprobe::ThreadPlan plan;
-    plan.alerts = true;
-    plan.nodes = true;
-    plan.removals = true;
+    plan.alerts = plan.nodes = plan.removals = true;
     plan.periodMs = 5;
     ictestprobe::setThreadPlan(plan);
 
@@ -69,47 +53,40 @@ TEST_F(PluginStress, ReloadsAlertsQueriesAndRegistrationsTogether)
     ASSERT_EQ(Open(&ic, &err), 0);
     int clientCtx = 0;
     ASSERT_EQ(ic->registerForAlerts(&client, IC::Node::Fan, &clientCtx).getStatus(), 0);
-
     auto* loader = new IC::LoaderThread(0, 1, &IST::TimedReload);
     IST::lt = loader;
     ASSERT_TRUE(loader->start());
 
     std::atomic<bool> stop{false};
-    std::atomic<long> queries{0};
-    std::atomic<long> mismatches{0};
-    std::vector<std::thread> workers;
-
+    std::atomic<long> queries{0}, mismatches{0};
+    std::vector<ictest::JoinedThread> workers;
     // Plug-in files come and go. Copies appear under new names only, so a
     // loaded image is never overwritten in place.
     workers.emplace_back([&] {
         std::mt19937 rng(12345);
-        std::vector<std::string> const miModules{"mi_alpha", "mi_beta", "mi_gamma", "mi_thread"};
-        std::vector<std::string> const fpModules{"fp_one", "fp_two"};
-        std::vector<std::string> miFiles, fpFiles;
-        int serial = 0;
-        while (!stop) {
-            bool const mi = rng() % 2 == 0;
-            auto& files = mi ? miFiles : fpFiles;
-            auto const& modules = mi ? miModules : fpModules;
-            std::string const dir = mi ? tree_.miDir() : tree_.fpDir();
-            unsigned const op = rng() % 3;
-            if ((op == 0 && files.size() < 4) || files.empty()) {
-                std::string const as = "c" + std::to_string(serial++) + ".so";
-                files.push_back(tree_.install(dir, modules[rng() % modules.size()], as));
+        std::vector<std::string> const modules[] = {{"mi_alpha", "mi_beta", "mi_gamma", "mi_thread"},
+                                                    {"fp_one", "fp_two"}};
+        std::vector<std::string> files[2];
+        for (int serial = 0; !stop; ++serial) {
+            unsigned const kind = rng() % 2, op = rng() % 3;
+            std::string const dir = kind == 0 ? tree_.miDir() : tree_.fpDir();
+            auto& mine = files[kind];
+            if ((op == 0 && mine.size() < 4) || mine.empty()) {
+                mine.push_back(tree_.install(dir, modules[kind][rng() % modules[kind].size()],
+                                             "c" + std::to_string(serial) + ".so"));
             } else if (op == 1) {
-                std::size_t const i = rng() % files.size();
-                ictest::TempTree::remove(files[i]);
-                files.erase(files.begin() + static_cast<long>(i));
+                std::size_t const i = rng() % mine.size();
+                ictest::fs::remove(mine[i]);
+                mine.erase(mine.begin() + static_cast<long>(i));
             } else {
-                std::size_t const i = rng() % files.size();
-                std::string const to = dir + "/r" + std::to_string(serial++) + ".so";
-                ictest::TempTree::rename(files[i], to);
-                files[i] = to;
+                std::size_t const i = rng() % mine.size();
+                std::string const to = dir + "/r" + std::to_string(serial) + ".so";
+                ictest::fs::rename(mine[i], to);
+                mine[i] = to;
             }
             std::this_thread::sleep_for(std::chrono::milliseconds(150));
         }
     });
-
     // Clients reading nodes.
     for (int q = 0; q < 2; ++q)
         workers.emplace_back([&] {
@@ -120,12 +97,9 @@ TEST_F(PluginStress, ReloadsAlertsQueriesAndRegistrationsTogether)
                 for (IC::Node* n : nodes) {
                     std::string const path = ic->getNodeUniqueId(n);
                     IC::Node* found = nullptr;
-                    if (ic->getNode(path, &found).getStatus() == 0 && found == nullptr)
-                        ++mismatches;
-                    if (ic->printablePathToPath(ic->pathToPrintablePath(path)) != path)
-                        ++mismatches;
-                    if (ic->getNodeHierarchy(n).empty())
-                        ++mismatches;
+                    mismatches += ic->getNode(path, &found).getStatus() == 0 && found == nullptr;
+                    mismatches += ic->printablePathToPath(ic->pathToPrintablePath(path)) != path;
+                    mismatches += ic->getNodeHierarchy(n).empty();
                     ic->getNode(n->getNodeId(), &found);
                 }
                 ic->getMap(nodes, IC::Node::Fan);
@@ -139,37 +113,24 @@ TEST_F(PluginStress, ReloadsAlertsQueriesAndRegistrationsTogether)
                 std::this_thread::sleep_for(std::chrono::milliseconds(2));
             }
         });
-
     // Clients registering and deregistering.
     workers.emplace_back([&] {
         int ctx[4] = {0, 0, 0, 0};
-        IC::Node::SensorType const sensors[] = {IC::Node::Fan, IC::Node::CPU,
-                                                IC::Node::PowerSupply};
-        unsigned turn = 0;
-        while (!stop) {
+        IC::Node::SensorType const sensors[] = {IC::Node::Fan, IC::Node::CPU, IC::Node::PowerSupply};
+        for (unsigned turn = 0; !stop; ++turn) {
             void const* c = &ctx[turn % 4];
-            IC::Node::SensorType const s = sensors[turn % 3];
+            auto const s = sensors[turn % 3];
             ic->registerForAlerts(&client, s, c);
             ic->registerForSimpleAlerts(&simple, s, c);
             std::this_thread::sleep_for(std::chrono::milliseconds(3));
             ic->deRegisterForAlerts(&client, s, c);
             ic->deRegisterForSimpleAlerts(&simple, s, c);
-            ++turn;
         }
     });
-
-    auto const end = Clock::now() + std::chrono::seconds(8);
-    while (Clock::now() < end)
-        std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    std::this_thread::sleep_for(std::chrono::seconds(8));
     stop = true;
-    for (auto& w : workers)
-        w.join();
+    workers.clear();
 
-    RecordProperty("queries", static_cast<int>(queries.load()));
-    RecordProperty("clientAlerts", static_cast<int>(clientAlerts.load()));
-    RecordProperty("simpleEvents", static_cast<int>(simpleEvents.load()));
-    RecordProperty("interfaces", static_cast<int>(ictestprobe::mis().size()));
-    RecordProperty("functionalPlugIns", static_cast<int>(ictestprobe::fps().size()));
     EXPECT_EQ(mismatches.load(), 0);
     EXPECT_GT(queries.load(), 0);
     // Alerts went all the way from interface threads through the relay.
@@ -181,12 +142,9 @@ TEST_F(PluginStress, ReloadsAlertsQueriesAndRegistrationsTogether)
     Unloadlib();
     EXPECT_EQ(IST::ICloadCount, 0u);
     EXPECT_EQ(IST::lt, nullptr);
-    EXPECT_TRUE(IST::mymis.empty());
-    EXPECT_TRUE(IST::myfps.empty());
-    for (auto const& r : ictestprobe::mis()) {
-        EXPECT_TRUE(r.released) << r.name << " " << r.object;
-        EXPECT_FALSE(r.threadRunning) << r.name << " " << r.object;
-    }
+    EXPECT_TRUE(IST::mymis.empty() && IST::myfps.empty());
+    for (auto const& r : ictestprobe::mis())
+        EXPECT_TRUE(r.released && !r.threadRunning) << r.name << " " << r.object;
     for (auto const& r : ictestprobe::fps())
         EXPECT_TRUE(r.released) << r.name << " " << r.object;
     EXPECT_EQ(ictestprobe::liveImages(), 0);

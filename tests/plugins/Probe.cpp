@@ -39,27 +39,22 @@ State& state()
     return *s;
 }
 
-std::string const kLogger = "ictest.probe";
-
-MIRecord* miOf(State& s, void const* object)
+// f(state) under the probe's lock.
+template <class F>
+auto locked(F f)
 {
-    for (auto it = s.mis.rbegin(); it != s.mis.rend(); ++it)
-        if (it->object == object && !it->released)
-            return &*it;
-    return nullptr;
+    std::lock_guard<std::mutex> g(state().m);
+    return f(state());
 }
 
-FPRecord* fpOf(State& s, void const* object)
+// The newest unreleased record for which match holds; null if none.
+template <class Record, class Match>
+Record* newest(std::vector<Record>& records, Match match)
 {
-    for (auto it = s.fps.rbegin(); it != s.fps.rend(); ++it)
-        if (it->object == object && !it->released)
+    for (auto it = records.rbegin(); it != records.rend(); ++it)
+        if (!it->released && match(*it))
             return &*it;
     return nullptr;
-}
-
-bool startsWith(std::string const& s, std::string const& prefix)
-{
-    return s.compare(0, prefix.size(), prefix) == 0;
 }
 
 std::string const kRelayed = "relayed ";
@@ -68,34 +63,26 @@ std::string const kRelayed = "relayed ";
 
 void record(std::string const& event)
 {
-    State& s = state();
-    {
-        std::lock_guard<std::mutex> g(s.m);
+    locked([&](State& s) {
         s.events.push_back(event);
-    }
-    s.changed.notify_all();
-    HGLOG_EVENT("Probe", kLogger, 2000, event);
+        s.changed.notify_all();
+    });
+    HGLOG_EVENT("Probe", "ictest.probe", 2000, event);
 }
 
-std::vector<std::string> events()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.events;
-}
+std::vector<std::string> events() { return locked([](State& s) { return s.events; }); }
 
 std::size_t count(std::string const& event)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return static_cast<std::size_t>(std::count(s.events.begin(), s.events.end(), event));
+    auto const all = events();
+    return static_cast<std::size_t>(std::count(all.begin(), all.end(), event));
 }
 
 std::vector<std::string> eventsWithPrefix(std::string const& prefix)
 {
     std::vector<std::string> out;
     for (auto const& e : events())
-        if (startsWith(e, prefix))
+        if (e.compare(0, prefix.size(), prefix) == 0)
             out.push_back(e);
     return out;
 }
@@ -111,277 +98,144 @@ bool waitFor(std::string const& event, int timeoutMs, std::size_t n)
 
 void reset()
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    s.events.clear();
-    s.mis.clear();
-    s.fps.clear();
-    s.received.clear();
-    s.plan = ThreadPlan();
-    for (auto& r : s.relays)
-        r.active = false;
+    locked([](State& s) {
+        s.events.clear();
+        s.mis.clear();
+        s.fps.clear();
+        s.received.clear();
+        s.plan = ThreadPlan();
+        for (auto& r : s.relays)
+            r.active = false;
+    });
 }
 
 void imageLoaded(std::string const& name)
 {
-    {
-        State& s = state();
-        std::lock_guard<std::mutex> g(s.m);
-        ++s.liveImages;
-    }
+    locked([](State& s) { ++s.liveImages; });
     record(name + ":image loaded");
 }
 
 void imageUnloaded(std::string const& name)
 {
-    {
-        State& s = state();
-        std::lock_guard<std::mutex> g(s.m);
-        --s.liveImages;
-    }
+    locked([](State& s) { --s.liveImages; });
     record(name + ":image unloaded");
 }
 
-int liveImages()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.liveImages;
-}
+int liveImages() { return locked([](State& s) { return s.liveImages; }); }
 
 IC::Node* makeNode(IC::Node::SensorType type, unsigned int instance, unsigned int nodeId,
                    unsigned int linkedId, std::string const& description, unsigned int nodeNumber)
 {
     auto node = std::make_unique<IC::Node>(type, instance, nodeId, linkedId, description, nodeNumber);
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    s.nodes.push_back(std::move(node));
-    return s.nodes.back().get();
+    return locked([&](State& s) {
+        s.nodes.push_back(std::move(node));
+        return s.nodes.back().get();
+    });
 }
 
-// ---- management interfaces ----
+// ---- plug-in records ----
 
-void miCreated(std::string const& name, void const* object)
+void created(bool mi, std::string const& name, void const* object)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    MIRecord r;
-    r.name = name;
-    r.object = object;
-    s.mis.push_back(r);
+    auto add = [&](auto& records) {
+        records.emplace_back();
+        records.back().name = name;
+        records.back().object = object;
+    };
+    locked([&](State& s) { mi ? add(s.mis) : add(s.fps); });
 }
 
-void miNodeCallBacks(void const* object, IC::NodeArrivalCallBack arrival, void const* context,
-                     IC::NodeLookupCallBack lookup)
+void updateMI(void const* object, std::function<void(MIRecord&)> const& change)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object)) {
-        r->arrival = arrival;
-        r->arrivalContext = context;
-        r->lookup = lookup;
-    }
+    locked([&](State& s) {
+        if (MIRecord* r = newest(s.mis, [object](MIRecord const& m) { return m.object == object; }))
+            change(*r);
+    });
 }
 
-void miInitialized(void const* object, unsigned int base, std::vector<IC::Node*> const& nodes)
+void updateFP(void const* object, std::function<void(FPRecord&)> const& change)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object)) {
-        r->base = base;
-        r->nodes = nodes;
-    }
+    locked([&](State& s) {
+        if (FPRecord* r = newest(s.fps, [object](FPRecord const& f) { return f.object == object; }))
+            change(*r);
+    });
 }
 
-void miAlerts(void const* object, IC::AlertCallBack callback, void const* context)
+std::shared_ptr<IC::ICforFP const> copyServices(IC::ICforFP const& services)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object)) {
-        r->alert = callback;
-        r->alertContext = context;
-    }
-}
-
-void miShutdown(void const* object)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object))
-        r->shutdown = true;
-}
-
-void miReleased(void const* object)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object))
-        r->released = true;
-}
-
-void miThread(void const* object, bool running)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (MIRecord* r = miOf(s, object))
-        r->threadRunning = running;
+    return std::make_shared<IC::ICforFP const>(services);
 }
 
 bool findMI(std::string const& name, MIRecord* out)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    for (auto it = s.mis.rbegin(); it != s.mis.rend(); ++it)
-        if (it->name == name && !it->released) {
-            if (out)
-                *out = *it;
-            return true;
-        }
-    return false;
-}
-
-std::vector<MIRecord> mis()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.mis;
-}
-
-void setThreadPlan(ThreadPlan const& plan)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    s.plan = plan;
-}
-
-ThreadPlan threadPlan()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.plan;
-}
-
-// ---- functional plug-ins ----
-
-void fpCreated(std::string const& name, void const* object)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    FPRecord r;
-    r.name = name;
-    r.object = object;
-    s.fps.push_back(r);
-}
-
-void fpInitialized(void const* object, unsigned int base, IC::ICforFP const& services,
-                   std::vector<IC::Node*> const& nodes)
-{
-    auto copy = std::make_shared<IC::ICforFP const>(services);
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (FPRecord* r = fpOf(s, object)) {
-        r->base = base;
-        r->services = copy;
-        r->nodes = nodes;
-    }
-}
-
-void fpUpdated(void const* object, std::vector<IC::ManagementInterface*> const& added,
-               std::vector<IC::ManagementInterface*> const& removed)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (FPRecord* r = fpOf(s, object)) {
-        r->lastAdded = added;
-        r->lastRemoved = removed;
-        ++r->updates;
-    }
-}
-
-void fpReleased(void const* object)
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    if (FPRecord* r = fpOf(s, object))
-        r->released = true;
+    return locked([&](State& s) {
+        MIRecord* r = newest(s.mis, [&name](MIRecord const& m) { return m.name == name; });
+        if (r && out)
+            *out = *r;
+        return r != nullptr;
+    });
 }
 
 bool findFP(std::string const& name, FPRecord* out)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    for (auto it = s.fps.rbegin(); it != s.fps.rend(); ++it)
-        if (it->name == name && !it->released) {
-            if (out)
-                *out = *it;
-            return true;
-        }
-    return false;
+    return locked([&](State& s) {
+        FPRecord* r = newest(s.fps, [&name](FPRecord const& f) { return f.name == name; });
+        if (r && out)
+            *out = *r;
+        return r != nullptr;
+    });
 }
 
-std::vector<FPRecord> fps()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.fps;
-}
+std::vector<MIRecord> mis() { return locked([](State& s) { return s.mis; }); }
+std::vector<FPRecord> fps() { return locked([](State& s) { return s.fps; }); }
+void setThreadPlan(ThreadPlan const& plan) { locked([&](State& s) { s.plan = plan; }); }
+ThreadPlan threadPlan() { return locked([](State& s) { return s.plan; }); }
 
 // ---- relay ----
 
 void const* relayOpen(std::string const& name, IC::AlertSink sink)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    s.relays.push_back(RelaySlot{name, sink, true});
-    return &s.relays.back();
+    return locked([&](State& s) {
+        s.relays.push_back(RelaySlot{name, sink, true});
+        return static_cast<void const*>(&s.relays.back());
+    });
 }
 
 void relayClose(void const* context)
 {
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    for (auto& r : s.relays)
-        if (&r == context)
-            r.active = false;
+    locked([&](State& s) {
+        for (auto& r : s.relays)
+            r.active = r.active && &r != context;
+    });
 }
 
 IC::Error relayAlerts(std::vector<IC::Alert> const& alerts, void const* context)
 {
-    State& s = state();
     std::string name;
     IC::AlertSink sink = nullptr;
     std::vector<IC::Alert> out;
-    {
-        std::lock_guard<std::mutex> g(s.m);
+    locked([&](State& s) {
         for (auto& r : s.relays)
             if (&r == context) {
                 name = r.name;
-                if (r.active)
-                    sink = r.sink;
+                sink = r.active ? r.sink : nullptr;
             }
-        for (auto const& a : alerts) {
-            if (startsWith(a.getMessage(), kRelayed))
-                continue;
-            s.received.push_back(a);
-            out.emplace_back(a.getSeverity(), a.getClass(), a.getNodePaths(), a.getStatus(),
-                             kRelayed + a.getMessage());
-        }
-    }
+        for (auto const& a : alerts)
+            if (a.getMessage().compare(0, kRelayed.size(), kRelayed) != 0) {
+                s.received.push_back(a);
+                out.emplace_back(a.getSeverity(), a.getClass(), a.getNodePaths(), a.getStatus(),
+                                 kRelayed + a.getMessage());
+            }
+    });
+    IC::Error const done(0, IC::Number(IC::Number::Generic), "");
     if (out.empty())
-        return IC::Error(0, IC::Number(IC::Number::Generic), "");
+        return done;
     record(name + ":relayed n=" + std::to_string(out.size()));
     // The sink runs without the probe's lock: it reaches client callbacks,
     // which read the probe too.
-    if (sink != nullptr)
-        return sink(out);
-    return IC::Error(0, IC::Number(IC::Number::Generic), "");
+    return sink != nullptr ? sink(out) : done;
 }
 
-std::vector<IC::Alert> relayReceived()
-{
-    State& s = state();
-    std::lock_guard<std::mutex> g(s.m);
-    return s.received;
-}
+std::vector<IC::Alert> relayReceived() { return locked([](State& s) { return s.received; }); }
 
 } // namespace ictestprobe

@@ -12,6 +12,7 @@
 #include <IC/Node.h>
 
 #include <cstddef>
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -46,7 +47,7 @@ IC::Node* makeNode(IC::Node::SensorType type, unsigned int instance, unsigned in
                    unsigned int linkedId, std::string const& description,
                    unsigned int nodeNumber = 0);
 
-// ---- management interfaces ----
+// ---- what the plug-ins were given ----
 struct MIRecord {
     std::string name;
     void const* object = nullptr;
@@ -62,29 +63,6 @@ struct MIRecord {
     bool released = false;
     bool threadRunning = false;
 };
-void miCreated(std::string const& name, void const* object);
-void miNodeCallBacks(void const* object, IC::NodeArrivalCallBack arrival,
-                     void const* context, IC::NodeLookupCallBack lookup);
-void miInitialized(void const* object, unsigned int base, std::vector<IC::Node*> const& nodes);
-void miAlerts(void const* object, IC::AlertCallBack callback, void const* context);
-void miShutdown(void const* object);
-void miReleased(void const* object);
-void miThread(void const* object, bool running);
-// The newest record of that name not yet released.
-bool findMI(std::string const& name, MIRecord* out);
-std::vector<MIRecord> mis();
-
-// What the threaded management interface does on each turn of its thread.
-struct ThreadPlan {
-    bool alerts = false;   // raise an alert on its CPU node
-    bool nodes = false;    // report a further node through the arrival callback
-    bool removals = false; // now and then a class-4 alert for a node it reported
-    int periodMs = 20;
-};
-void setThreadPlan(ThreadPlan const& plan);
-ThreadPlan threadPlan();
-
-// ---- functional plug-ins ----
 struct FPRecord {
     std::string name;
     void const* object = nullptr;
@@ -96,14 +74,28 @@ struct FPRecord {
     int updates = 0;
     bool released = false;
 };
-void fpCreated(std::string const& name, void const* object);
-void fpInitialized(void const* object, unsigned int base, IC::ICforFP const& services,
-                   std::vector<IC::Node*> const& nodes);
-void fpUpdated(void const* object, std::vector<IC::ManagementInterface*> const& added,
-               std::vector<IC::ManagementInterface*> const& removed);
-void fpReleased(void const* object);
+// A new record for the object; then changes to the newest unreleased record
+// of the object, made under the probe's lock.
+void created(bool mi, std::string const& name, void const* object);
+void updateMI(void const* object, std::function<void(MIRecord&)> const& change);
+void updateFP(void const* object, std::function<void(FPRecord&)> const& change);
+// A copy made here, so that a record outlives the image of its plug-in.
+std::shared_ptr<IC::ICforFP const> copyServices(IC::ICforFP const& services);
+// The newest record of that name not yet released.
+bool findMI(std::string const& name, MIRecord* out);
 bool findFP(std::string const& name, FPRecord* out);
+std::vector<MIRecord> mis();
 std::vector<FPRecord> fps();
+
+// What the threaded management interface does on each turn of its thread.
+struct ThreadPlan {
+    bool alerts = false;   // raise an alert on its CPU node
+    bool nodes = false;    // report a further node through the arrival callback
+    bool removals = false; // now and then a class-4 alert for a node it reported
+    int periodMs = 20;
+};
+void setThreadPlan(ThreadPlan const& plan);
+ThreadPlan threadPlan();
 
 // ---- the relay of a functional plug-in ----
 // A relaying plug-in registers relayAlerts with the context relayOpen gave

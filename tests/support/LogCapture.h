@@ -29,19 +29,20 @@ public:
         std::lock_guard<std::mutex> g(m_);
         return records_;
     }
-    // Events of the log channel only (every event is also on the trace one).
-    std::vector<HGLog::Record> logs() const
+    // Events of the log channel only (every event is also on the trace one);
+    // of one logger when one is named.
+    std::vector<HGLog::Record> logs(std::string const& logger = std::string()) const
     {
         std::vector<HGLog::Record> out;
         for (auto const& r : records())
-            if (r.channel == HGLog::Channel::Log)
+            if (r.channel == HGLog::Channel::Log && (logger.empty() || r.logger == logger))
                 out.push_back(r);
         return out;
     }
-    std::vector<std::string> messages() const
+    std::vector<std::string> messages(std::string const& logger = std::string()) const
     {
         std::vector<std::string> out;
-        for (auto const& r : logs())
+        for (auto const& r : logs(logger))
             out.push_back(r.message);
         return out;
     }
@@ -50,6 +51,14 @@ public:
     {
         auto const m = messages();
         return static_cast<std::size_t>(std::count(m.begin(), m.end(), text));
+    }
+    // The same for one logger and level.
+    std::size_t count(std::string const& logger, int level, std::string const& text) const
+    {
+        std::size_t n = 0;
+        for (auto const& r : logs(logger))
+            n += r.level == level && r.message == text;
+        return n;
     }
     // The first log-channel event whose message equals text; null if none.
     bool find(std::string const& text, HGLog::Record* out = nullptr) const
