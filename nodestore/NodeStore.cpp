@@ -1,4 +1,5 @@
 #include <IC/NodeStore.h>
+#include <IC/SensorTypeNames.h>
 
 #include <HGLog/HGLogger.h>
 
@@ -15,20 +16,7 @@ namespace NODESTORE {
 // every sensor type, indexed by its value.
 std::string loggerNodeStore = "Helmgard.IC.InstrumentationControl.NodeStore";
 
-std::string NSTS[75] = {
-    "Unknown", "Chassis", "BIOS", "Firmware", "CPU", "USB Controller", "USB Port",
-    "Serial Port", "Parallel Port", "Video", "Floppy Drive", "Hard Drive", "Network Port",
-    "BMC", "KVR", "SMBIOS", "VPD", "OS", "RAM", "DIMM", "Fan", "Voltage Sensor",
-    "Temperature Sensor", "Intrusion", "PFA", "Power Supply", "Blue Light", "Front Panel",
-    "Back Panel", "Network IP Configuration", "System", "Cache", "Memory Array",
-    "Memory Device", "IPMI", "Log", "Tallowmere", "Service Processor", "OsHw", "OsSw",
-    "Computer", "Planar", "CPU Core", "Application", "Driver", "Partition", "User",
-    "LogEntry", "PFASensor", "Network Controller", "Disk Controller", "Group",
-    "Kelmar Alert Config", "Diagnostics", "SMBIOS Data", "SMBIOS Table", "Network Teaming",
-    "ScalablePartition", "ScalableSystem", "ROOT", "ModularChassis", "SlotGroup", "Slot",
-    "CMM", "IO Module", "CoolingDomain", "PowerDomain", "Chassis MidPlane Card",
-    "ModularGroup", "AlertIndication", "Connector", "BMCUser", "Drive Slot Sensor",
-    "LAN End Point", "invalid"};
+std::string NSTS[75] = {IC_SENSOR_TYPE_NAMES};
 
 } // namespace NODESTORE
 

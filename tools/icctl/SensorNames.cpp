@@ -3,27 +3,13 @@
 #include "Errors.h"
 #include "ShippedAlerts.h"
 
+#include <IC/SensorTypeNames.h>
+
 #include <cctype>
 #include <cstdlib>
 
 namespace icctl {
 namespace {
-
-// The library keeps its display names to itself; these are the same.
-char const* const kSensorNames[] = {
-    "Unknown", "Chassis", "BIOS", "Firmware", "CPU", "USB Controller", "USB Port",
-    "Serial Port", "Parallel Port", "Video", "Floppy Drive", "Hard Drive", "Network Port",
-    "BMC", "KVR", "SMBIOS", "VPD", "OS", "RAM", "DIMM", "Fan", "Voltage Sensor",
-    "Temperature Sensor", "Intrusion", "PFA", "Power Supply", "Blue Light", "Front Panel",
-    "Back Panel", "Network IP Configuration", "System", "Cache", "Memory Array",
-    "Memory Device", "IPMI", "Log", "Tallowmere", "Service Processor", "OsHw", "OsSw",
-    "Computer", "Planar", "CPU Core", "Application", "Driver", "Partition", "User",
-    "LogEntry", "PFASensor", "Network Controller", "Disk Controller", "Group",
-    "Kelmar Alert Config", "Diagnostics", "SMBIOS Data", "SMBIOS Table", "Network Teaming",
-    "ScalablePartition", "ScalableSystem", "ROOT", "ModularChassis", "SlotGroup", "Slot",
-    "CMM", "IO Module", "CoolingDomain", "PowerDomain", "Chassis MidPlane Card",
-    "ModularGroup", "AlertIndication", "Connector", "BMCUser", "Drive Slot Sensor",
-    "LAN End Point", "invalid"};
 
 constexpr unsigned int kValidTypes = IC::Node::invalid; // 0..73
 
@@ -53,8 +39,8 @@ bool parseNumber(std::string const& s, unsigned long* value)
 
 std::string sensorName(unsigned int type)
 {
-    if (type < sizeof kSensorNames / sizeof kSensorNames[0])
-        return kSensorNames[type];
+    if (type < IC::sensorTypeCount)
+        return IC::sensorTypeNames[type];
     return "type " + std::to_string(type);
 }
 
@@ -69,7 +55,7 @@ IC::Node::SensorType parseSensor(std::string const& text)
     }
     std::string const wanted = squash(text);
     for (unsigned int t = 0; t < kValidTypes; ++t)
-        if (!wanted.empty() && squash(kSensorNames[t]) == wanted)
+        if (!wanted.empty() && squash(IC::sensorTypeNames[t]) == wanted)
             return static_cast<IC::Node::SensorType>(t);
     throw UsageError("unknown sensor type '" + text +
                      "' (give a name such as \"Temperature Sensor\" or a number; "
