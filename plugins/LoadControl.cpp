@@ -25,6 +25,8 @@ Error LoadControl::findLibs(std::string dir, std::vector<libstruct>& libs, std::
     auto const dirLength = static_cast<std::uint16_t>(dir.size());
     SD::DirectoryReader reader(dir.c_str(), ".so");
     int const count = reader.getNumberOfFiles();
+    // The directories above the plug-ins are judged once per pass.
+    SD::PlatformUtilities::Scan const scan;
     for (int i = 0; i < count; ++i) {
         char const* const entry = reader.getFileName(i);
         std::string const path = entry ? entry : "";

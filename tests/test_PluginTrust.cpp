@@ -532,6 +532,63 @@ TEST_F(PluginTrust, ALibraryThatStaysMappedAfterCloseIsNotMistakenForTheNextOne)
     EXPECT_EQ(markerText(), "trust_lingering\ntrust_probe\ntrust_probe\ntrust_probe\n");
 }
 
+// ------------------------------------------------------------------- scans
+
+// A scan reuses the walk down to a directory, never the verdict on a file:
+// in one pass, each file of the directory is still judged on its own, and a
+// file elsewhere gets its own walk.
+TEST_F(PluginTrust, InAScanEachFileIsStillJudgedOnItsOwn)
+{
+    makeDir("mi", 0755);
+    makeDir("open", 0777);
+    copyFixture("trust_probe", "mi/a.so");
+    copyFixture("trust_probe", "mi/writable.so", 0666);
+    ASSERT_EQ(mkfifo(path("mi/pipe.so").c_str(), 0644), 0);
+    copyFixture("trust_other", "other.so");
+    link(path("other.so"), "mi/link.so");
+    copyFixture("trust_probe", "open/c.so");
+
+    SD::PlatformUtilities::Scan const scan;
+    expectAccepted(path("mi/a.so"), "trust_probe");
+    std::remove(marker_.c_str());
+    expectRefused(path("mi/writable.so"), "is writable by group or others (mode 0666)");
+    expectRefused(path("mi/pipe.so"), "not a regular file");
+    expectRefused(path("mi/missing.so"), "No such file or directory");
+    expectRefused(path("open/c.so"), "directory " + path("open") + " is writable");
+    expectRefused(path("mi/.."), "not a regular file");
+    expectAccepted(path("mi/link.so"), "trust_other");
+    std::remove(marker_.c_str());
+    expectAccepted(path("mi/a.so"), "trust_probe");
+}
+
+// The verdict on the directories lasts as long as the scan: a directory
+// opened to others during a pass is refused from the next pass on. An
+// inner scan keeps its own verdicts and leaves the outer one's alone.
+TEST_F(PluginTrust, DirectoriesAreJudgedOncePerScan)
+{
+    makeDir("mi", 0755);
+    makeDir("fp", 0755);
+    copyFixture("trust_probe", "mi/a.so");
+    copyFixture("trust_probe", "mi/b.so");
+    copyFixture("trust_other", "fp/f.so");
+    {
+        SD::PlatformUtilities::Scan const outer;
+        expectAccepted(path("mi/a.so"), "trust_probe");
+        std::remove(marker_.c_str());
+        {
+            SD::PlatformUtilities::Scan const inner;
+            expectAccepted(path("fp/f.so"), "trust_other");
+            std::remove(marker_.c_str());
+            ASSERT_EQ(chmod(path("fp").c_str(), 0777), 0);
+        }
+        ASSERT_EQ(chmod(path("mi").c_str(), 0777), 0);
+        expectAccepted(path("mi/b.so"), "trust_probe");
+        std::remove(marker_.c_str());
+        expectRefused(path("fp/f.so"), "directory " + path("fp") + " is writable");
+    }
+    expectRefused(path("mi/b.so"), "directory " + path("mi") + " is writable");
+}
+
 // Sends the library's log output nowhere while it lives; a listener still
 // sees everything.
 class QuietLogs {
@@ -552,8 +609,13 @@ private:
 // Another thread keeps exchanging a trusted library and a foreign-owned one
 // under the name being loaded. Whichever is checked must be the one loaded:
 // the foreign one's constructor never runs.
-TEST_F(PluginTrust, FileSwappedDuringTheLoadIsNeverLoadedUnchecked)
+class PluginTrustSwap : public PluginTrust, public ::testing::WithParamInterface<bool> {};
+
+TEST_P(PluginTrustSwap, FileSwappedDuringTheLoadIsNeverLoadedUnchecked)
 {
+    std::optional<SD::PlatformUtilities::Scan> scan;
+    if (GetParam())
+        scan.emplace();
     copyFixture("trust_probe", "plugin.so");
     copyFixture("trust_other", "spare.so");
     NEED_FOREIGN_OWNER("spare.so");
@@ -601,5 +663,10 @@ TEST_F(PluginTrust, FileSwappedDuringTheLoadIsNeverLoadedUnchecked)
         }
     }
 }
+
+INSTANTIATE_TEST_SUITE_P(AloneAndInAScan, PluginTrustSwap, ::testing::Bool(),
+                         [](::testing::TestParamInfo<bool> const& info) {
+                             return info.param ? std::string("InAScan") : std::string("Alone");
+                         });
 
 } // namespace

@@ -177,76 +177,127 @@ bool fileTrusted(std::string const& file, struct stat const& st, std::string& re
     return true;
 }
 
-// What the walk found: the file's descriptor (O_PATH) and its status.
-struct CheckedFile {
-    Descriptor fd;
-    struct stat st {};
+// The chain from "/" to the file as it was walked: every component opened
+// relative to the one before without following links, so that what is
+// judged is exactly the chain that leads to the file.
+struct Walk {
+    std::vector<std::string> paths; // "/", each directory, then the file
+    std::vector<struct stat> stats; // as many as components were reached
+    Descriptor ownDir;              // the file's directory (O_PATH), unless a scan holds it
+    int dir = -1;                   // the file's directory, whoever holds it
+    std::size_t dirs = 0;           // how many of paths and stats are directories
+    std::string name;               // the file's name in it
+    bool complete = false;          // every component reached, the file regular
 };
 
-// Walks the link-free absolute path from "/" one component at a time, each
-// opened relative to the directory checked just before and without following
-// links, so that what is checked is exactly the chain that leads to the
-// returned descriptor. O_PATH opens nothing: a FIFO does not block and a
-// device sees no open. With enforce false only the file type is checked.
-bool openChecked(std::string const& resolved, bool enforce, CheckedFile& out, std::string& reason)
+// Splits an absolute path into its names; false when one of them is "." or
+// "..", which only a resolved path may skip.
+bool splitNames(std::string const& path, std::vector<std::string>& names)
 {
-    std::vector<std::string> names;
-    for (std::size_t pos = 0; pos < resolved.size();) {
-        std::size_t const slash = resolved.find('/', pos);
-        std::size_t const end = slash == std::string::npos ? resolved.size() : slash;
-        if (end > pos)
-            names.push_back(resolved.substr(pos, end - pos));
+    for (std::size_t pos = 0; pos < path.size();) {
+        std::size_t const slash = path.find('/', pos);
+        std::size_t const end = slash == std::string::npos ? path.size() : slash;
+        if (end > pos) {
+            names.push_back(path.substr(pos, end - pos));
+            if (names.back() == "." || names.back() == "..")
+                return false;
+        }
         pos = end + 1;
     }
-    if (names.empty()) {
+    return true;
+}
+
+// Takes the status of the file in the walked directory, without opening it.
+bool finishWalk(Walk& walk, std::string const& name, std::string& reason)
+{
+    std::string path = childPath(walk.paths.back(), name);
+    struct stat st {};
+    if (::fstatat(walk.dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
+        reason = path + ": " + errorText(errno);
+        return false;
+    }
+    walk.paths.push_back(std::move(path));
+    walk.stats.push_back(st);
+    // Opening a FIFO would block, and a directory or device is never a
+    // library.
+    if (!S_ISREG(st.st_mode)) {
         reason = "not a regular file";
         return false;
     }
+    walk.name = name;
+    walk.complete = true;
+    return true;
+}
 
+// Opens every directory of the path with O_PATH (which opens nothing: a FIFO
+// does not block and a device sees no open) and takes the file's status
+// without opening it at all. Stops at the first component that cannot be
+// reached, is a link, or is of the wrong type; reason says which. The
+// statuses gathered so far are kept either way, so that a refusal found on
+// the way can be judged first.
+bool walkPath(std::string const& file, Walk& walk, std::string& reason)
+{
+    std::vector<std::string> names;
+    if (!splitNames(file, names) || names.empty()) {
+        reason = "not a regular file";
+        return false;
+    }
     Descriptor dir(::open("/", O_PATH | O_DIRECTORY | O_CLOEXEC));
-    struct stat dirStat {};
-    if (!dir.valid() || ::fstat(dir.get(), &dirStat) != 0) {
+    struct stat st {};
+    if (!dir.valid() || ::fstat(dir.get(), &st) != 0) {
         reason = "/: " + errorText(errno);
         return false;
     }
-    std::string dirPath = "/";
-    for (std::size_t i = 0; i < names.size(); ++i) {
-        bool const last = i + 1 == names.size();
-        std::string const path = childPath(dirPath, names[i]);
-        int const flags = O_PATH | O_NOFOLLOW | O_CLOEXEC | (last ? 0 : O_DIRECTORY);
-        Descriptor next(::openat(dir.get(), names[i].c_str(), flags));
-        struct stat st {};
+    walk.paths.reserve(names.size() + 1);
+    walk.stats.reserve(names.size() + 1);
+    walk.paths.emplace_back("/");
+    walk.stats.push_back(st);
+    for (std::size_t i = 0; i + 1 < names.size(); ++i) {
+        std::string path = childPath(walk.paths.back(), names[i]);
+        Descriptor next(::openat(dir.get(), names[i].c_str(),
+                                 O_PATH | O_NOFOLLOW | O_DIRECTORY | O_CLOEXEC));
         if (!next.valid() || ::fstat(next.get(), &st) != 0) {
-            // The path was resolved a moment ago: whatever fails now was
-            // changed in between, or cannot be searched.
+            // A resolved path has no links: whatever fails now was changed
+            // since, or cannot be searched.
             reason = path + ": " + errorText(errno);
             return false;
         }
-        if (enforce && !directoryTrusted(dirPath, dirStat, path, st, reason))
-            return false;
-        if (!last) {
-            if (!S_ISDIR(st.st_mode)) {
-                reason = path + ": " + errorText(ENOTDIR);
-                return false;
-            }
-            dir = std::move(next);
-            dirStat = st;
-            dirPath = path;
-            continue;
-        }
-        // Opening a FIFO would block, and a directory or device is never a
-        // library.
-        if (!S_ISREG(st.st_mode)) {
-            reason = "not a regular file";
-            return false;
-        }
-        if (enforce && !fileTrusted(path, st, reason))
-            return false;
-        out.fd = std::move(next);
-        out.st = st;
-        return true;
+        walk.paths.push_back(std::move(path));
+        walk.stats.push_back(st);
+        dir = std::move(next);
     }
-    return false; // not reached: the last component returns
+    walk.ownDir = std::move(dir);
+    walk.dir = walk.ownDir.get();
+    walk.dirs = walk.stats.size();
+    return finishWalk(walk, names.back(), reason);
+}
+
+// Judges the components reached, in order: each directory for the entry
+// below it, then the file itself.
+bool chainTrusted(Walk const& walk, std::string& reason)
+{
+    for (std::size_t i = 1; i < walk.stats.size(); ++i)
+        if (!directoryTrusted(walk.paths[i - 1], walk.stats[i - 1], walk.paths[i], walk.stats[i], reason))
+            return false;
+    return !walk.complete || fileTrusted(walk.paths.back(), walk.stats.back(), reason);
+}
+
+// Opens the judged file for reading through its directory's descriptor and
+// makes sure it is still the file that was judged; reason is set only when
+// it is not. A file that cannot be read is left to the loader to report.
+Descriptor openJudged(Walk const& walk, std::string& reason)
+{
+    Descriptor fd(::openat(walk.dir, walk.name.c_str(),
+                           O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    struct stat st {};
+    if (!fd.valid() || ::fstat(fd.get(), &st) != 0)
+        return Descriptor();
+    struct stat const& judged = walk.stats.back();
+    if (st.st_dev != judged.st_dev || st.st_ino != judged.st_ino) {
+        reason = "the file changed while it was being loaded";
+        return Descriptor();
+    }
+    return fd;
 }
 
 std::string descriptorName(int fd)
@@ -319,16 +370,36 @@ bool readAt(int fd, void* buffer, std::size_t size, std::uint64_t offset)
 // Whether the library's run paths or dependencies use $ORIGIN, which the
 // loader works out from the name it was given: through /proc/self/fd it
 // would point into /proc. Anything it cannot read counts as no, and the
-// loader then reports the file itself.
+// loader then reports the file itself. The first block read usually holds
+// the headers and, in a small library, the string table too.
 bool usesOrigin(int fd)
 {
+    char head[4096];
+    ssize_t got = 0;
+    do
+        got = ::pread(fd, head, sizeof head, 0);
+    while (got < 0 && errno == EINTR);
+    if (got < static_cast<ssize_t>(sizeof(ElfW(Ehdr))))
+        return false;
+    auto const headSize = static_cast<std::uint64_t>(got);
+    // Copies size bytes at offset, from the block already read when it holds
+    // them.
+    auto const fetch = [&](void* buffer, std::size_t size, std::uint64_t offset) {
+        if (offset <= headSize && size <= headSize - offset) {
+            std::memcpy(buffer, head + offset, size);
+            return true;
+        }
+        return readAt(fd, buffer, size, offset);
+    };
+
     ElfW(Ehdr) header;
-    if (!readAt(fd, &header, sizeof header, 0) || std::memcmp(header.e_ident, ELFMAG, SELFMAG) != 0 ||
+    std::memcpy(&header, head, sizeof header);
+    if (std::memcmp(header.e_ident, ELFMAG, SELFMAG) != 0 ||
         header.e_ident[EI_CLASS] != (__ELF_NATIVE_CLASS == 64 ? ELFCLASS64 : ELFCLASS32) ||
         header.e_phentsize != sizeof(ElfW(Phdr)) || header.e_phnum == 0)
         return false;
     std::vector<ElfW(Phdr)> segments(header.e_phnum);
-    if (!readAt(fd, segments.data(), segments.size() * sizeof(ElfW(Phdr)), header.e_phoff))
+    if (!fetch(segments.data(), segments.size() * sizeof(ElfW(Phdr)), header.e_phoff))
         return false;
     ElfW(Phdr) const* dynamic = nullptr;
     for (auto const& segment : segments)
@@ -339,7 +410,7 @@ bool usesOrigin(int fd)
         dynamic->p_filesz / sizeof(ElfW(Dyn)) > kMaxEntries)
         return false;
     std::vector<ElfW(Dyn)> entries(dynamic->p_filesz / sizeof(ElfW(Dyn)));
-    if (!readAt(fd, entries.data(), entries.size() * sizeof(ElfW(Dyn)), dynamic->p_offset))
+    if (!fetch(entries.data(), entries.size() * sizeof(ElfW(Dyn)), dynamic->p_offset))
         return false;
 
     std::uint64_t table = 0;
@@ -373,13 +444,13 @@ bool usesOrigin(int fd)
     if (!found || tableSize > kMaxTable)
         return false;
     std::string text(static_cast<std::size_t>(tableSize), '\0');
-    if (!readAt(fd, &text[0], text.size(), tableOffset))
+    if (!fetch(&text[0], text.size(), tableOffset))
         return false;
     for (std::uint64_t at : strings) {
         if (at >= text.size())
             continue;
-        std::string const value = text.c_str() + at;
-        if (value.find("$ORIGIN") != std::string::npos || value.find("${ORIGIN}") != std::string::npos)
+        char const* const value = text.c_str() + at;
+        if (std::strstr(value, "$ORIGIN") != nullptr || std::strstr(value, "${ORIGIN}") != nullptr)
             return true;
     }
     return false;
@@ -392,33 +463,53 @@ std::string loaderError(char const* fallback)
     return reason != nullptr ? std::string(reason) : std::string(fallback);
 }
 
+// Whether an object the loader holds is known by name. The loader looks a
+// name up among the objects it holds before it opens anything: a library
+// closed since but still mapped (unique symbols, -z nodelete) keeps the name
+// /proc/self/fd/<n> of a descriptor number that may now be reused. Looking
+// costs no system call.
+bool nameHeld(std::string const& name)
+{
+    return dl_iterate_phdr(
+               [](struct dl_phdr_info* info, std::size_t, void* wanted) {
+                   return info->dlpi_name != nullptr &&
+                                  *static_cast<std::string const*>(wanted) == info->dlpi_name
+                              ? 1
+                              : 0;
+               },
+               const_cast<std::string*>(&name)) != 0;
+}
+
 // Loads the library through the name /proc/self/fd/<fd>, which the kernel
-// resolves to the very file the descriptor holds. The loader finds a library
-// that is already open by that name before it opens anything: a library
-// closed since but still mapped (unique symbols, -z nodelete) may carry the
-// name of a descriptor number now reused. Such a name is left for another
-// number. On return fd is the descriptor actually used.
+// resolves to the very file the descriptor holds. A name already held is
+// left for another descriptor number. The loader may still hand back an
+// object it holds under another name (an added name, a soname, or the same
+// file mapped before): that is accepted only when it was mapped from the
+// checked file. On return fd is the descriptor actually used.
 void* loadThroughDescriptor(Descriptor& fd, struct stat const& st, std::string& reason)
 {
     constexpr int kAttempts = 64;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
         std::string const name = descriptorName(fd.get());
-        dlerror();
-        void* const holder = dlopen(name.c_str(), RTLD_LAZY | RTLD_LOCAL | RTLD_NOLOAD);
-        if (holder == nullptr || mappedFrom(holder, st)) {
+        if (!nameHeld(name)) {
             dlerror();
             // RTLD_NOW: an unresolved symbol shows now, before any of the
             // library's constructors run, not as a crash at first call.
             // RTLD_LOCAL: plug-ins export the same names and must not see
             // each other's.
             void* const library = dlopen(name.c_str(), RTLD_NOW | RTLD_LOCAL);
-            if (library == nullptr)
+            if (library == nullptr) {
                 reason = loaderError("unknown loader error");
-            if (holder != nullptr)
-                dlclose(holder);
-            return library;
+                return nullptr;
+            }
+            struct link_map* map = nullptr;
+            if (dlinfo(library, RTLD_DI_LINKMAP, &map) == 0 && map != nullptr &&
+                map->l_name != nullptr && name == map->l_name)
+                return library; // mapped just now, from the descriptor
+            if (mappedFrom(library, st))
+                return library;
+            dlclose(library);
         }
-        dlclose(holder);
         int const other = ::fcntl(fd.get(), F_DUPFD_CLOEXEC, fd.get() + 1);
         if (other < 0) {
             reason = errorText(errno);
@@ -452,6 +543,61 @@ void* loadThroughPath(std::string const& resolved, struct stat const& st, std::s
 
 } // namespace
 
+// What a scan remembers: the directory chain walked for the last directory
+// it saw, and that directory's descriptor.
+struct PlatformUtilities::Scan::State {
+    std::string directory; // as the caller spelled it
+    std::vector<std::string> paths;
+    std::vector<struct stat> stats;
+    Descriptor dir;
+};
+
+namespace {
+
+// The innermost scan of this thread.
+thread_local PlatformUtilities::Scan* currentScan = nullptr;
+
+// Walks a link-free absolute path, reusing the chain the scan holds when the
+// file lies in its directory, and leaving the chain of a new directory to it.
+bool walkInScan(PlatformUtilities::Scan::State* scan, std::string const& file, Walk& walk,
+                std::string& reason)
+{
+    std::size_t const slash = file.rfind('/');
+    if (scan != nullptr && scan->dir.valid() && slash == scan->directory.size() &&
+        file.compare(0, slash, scan->directory) == 0) {
+        std::string const name = file.substr(slash + 1);
+        if (name.empty() || name == "." || name == "..")
+            return false;
+        walk.paths = scan->paths;
+        walk.stats = scan->stats;
+        walk.dir = scan->dir.get();
+        walk.dirs = walk.stats.size();
+        return finishWalk(walk, name, reason);
+    }
+    bool const walked = walkPath(file, walk, reason);
+    if (scan != nullptr && walk.ownDir.valid()) {
+        scan->directory = file.substr(0, slash);
+        auto const dirs = static_cast<std::ptrdiff_t>(walk.dirs);
+        scan->paths.assign(walk.paths.begin(), walk.paths.begin() + dirs);
+        scan->stats.assign(walk.stats.begin(), walk.stats.begin() + dirs);
+        scan->dir = std::move(walk.ownDir);
+    }
+    return walked;
+}
+
+} // namespace
+
+PlatformUtilities::Scan::Scan() : state_(new State), outer_(currentScan)
+{
+    currentScan = this;
+}
+
+PlatformUtilities::Scan::~Scan()
+{
+    currentScan = outer_;
+    delete state_;
+}
+
 char PlatformUtilities::getSeparator()
 {
     return '/';
@@ -478,40 +624,58 @@ _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
         SD_LOG(LEVEL_FAILURE, "Cannot load a library: no path given");
         return nullptr;
     }
-    // Links are resolved first; what is checked, and loaded, is the file they
-    // lead to, along the directories that hold it.
-    std::unique_ptr<char, decltype(&std::free)> const real(realpath(path, nullptr), &std::free);
-    if (!real) {
-        int const error = errno;
-        SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", errorText(error));
-        return nullptr;
-    }
-    std::string const resolved = real.get();
-
     bool const enforce = !trustChecksOff();
-    CheckedFile checked;
     std::string reason;
-    if (!openChecked(resolved, enforce, checked, reason)) {
+    // A path without links is walked as given. Otherwise links are resolved
+    // first; what is checked, and loaded, is the file they lead to, along
+    // the directories that hold it.
+    Walk walk;
+    std::string resolved = path;
+    if (path[0] != '/' || resolved.back() == '/' ||
+        !walkInScan(currentScan != nullptr ? currentScan->state_ : nullptr, resolved, walk, reason)) {
+        std::unique_ptr<char, decltype(&std::free)> const real(realpath(path, nullptr), &std::free);
+        if (!real) {
+            int const error = errno;
+            SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", errorText(error));
+            return nullptr;
+        }
+        resolved = real.get();
+        walk = Walk();
+        walkPath(resolved, walk, reason);
+    }
+    // A refusal on the way is reported before whatever stopped the walk.
+    if ((enforce && !chainTrusted(walk, reason)) || !walk.complete) {
         SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", reason);
         return nullptr;
     }
+    resolved = walk.paths.back();
     if (!enforce)
         SD_LOG(LEVEL_WARNING, "Plug-in trust checks are off (", kTrustVariable, "=off): loading ", path,
                " without checking its owners and permissions");
 
-    // Reading the headers through /proc/self/fd also shows whether that name
-    // can be used at all (it cannot without /proc).
-    Descriptor readable(::open(descriptorName(checked.fd.get()).c_str(), O_RDONLY | O_CLOEXEC));
-    bool const byDescriptor = readable.valid() && !usesOrigin(readable.get());
-    readable.reset();
+    // Only a judged regular file is ever opened.
+    reason.clear();
+    Descriptor file = openJudged(walk, reason);
+    walk.ownDir.reset();
+    if (!reason.empty()) {
+        SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", reason);
+        return nullptr;
+    }
+    struct stat const& st = walk.stats.back();
+    bool const byDescriptor = file.valid() && !usesOrigin(file.get());
 
     void* library = nullptr;
     std::string usedName;
     if (byDescriptor) {
-        library = loadThroughDescriptor(checked.fd, checked.st, reason);
-        usedName = descriptorName(checked.fd.get());
+        library = loadThroughDescriptor(file, st, reason);
+        usedName = descriptorName(file.get());
+        // Without /proc the name leads nowhere; the path is all there is.
+        if (library == nullptr && ::access(usedName.c_str(), F_OK) != 0) {
+            library = loadThroughPath(resolved, st, reason);
+            usedName = resolved;
+        }
     } else {
-        library = loadThroughPath(resolved, checked.st, reason);
+        library = loadThroughPath(resolved, st, reason);
         usedName = resolved;
     }
     if (library == nullptr) {
@@ -519,7 +683,7 @@ _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
         return nullptr;
     }
     try {
-        return new _LibraryHandle{library, path, usedName, checked.fd.release()};
+        return new _LibraryHandle{library, path, usedName, file.release()};
     } catch (std::bad_alloc const&) {
         dlclose(library);
         SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": out of memory");

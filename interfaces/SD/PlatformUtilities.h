@@ -48,7 +48,31 @@ public:
     // IC_PLUGIN_TRUST=off (read on every call) switches the owner and
     // permission checks off for development; each load then logs a warning
     // saying so. Non-regular files are refused either way.
+    //
+    // While a Scan lives on the calling thread, the chain of directories
+    // down to a file's own directory is walked once and reused for the next
+    // files of that directory; each file is still checked on its own.
     static _LibraryHandle* loadLibrary(char const* path);
+
+    // Scope of one pass over a plug-in directory: the directories above the
+    // files are judged once, as they are when the first file is loaded, not
+    // again for every file. Scopes nest; each sees only its own verdicts.
+    // Not copyable; belongs to the thread that made it.
+    class ICCOMMON_API Scan {
+    public:
+        Scan();
+        ~Scan();
+        Scan(Scan const&) = delete;
+        Scan& operator=(Scan const&) = delete;
+
+        struct State; // what the scan remembers; opaque
+
+    private:
+        State* state_;
+        Scan* outer_;
+        friend class PlatformUtilities;
+    };
+
     // The address of a symbol of the library; null when it is missing.
     static void* loadSymbol(_LibraryHandle* handle, char* name);
     // Closes the library and frees the handle. Null is ignored.
