@@ -102,25 +102,15 @@ Error FPControl::myloadFPs(unsigned short& counter, std::vector<libstruct>& libs
                            std::vector<FunctionalPlugIn*>& fps, NodeStore&,
                            ICforFP const& services, std::vector<libstruct>& toLoad)
 {
-    unsigned int failed = 0;
-    for (auto it = toLoad.begin(); it != toLoad.end();) {
-        bool loaded = false;
-        try {
-            loaded = loadOne(*it, counter, libs, fps, services);
-        } catch (std::exception const& e) {
-            FP_LOG(6000, "myloadFPs: Exception ", e.what(), " Type=", typeid(e).name(), " for ",
-                   it->path);
-        } catch (...) {
-            FP_LOG(6000, "myloadFPs Caught exception for ", it->path);
-        }
-        if (loaded) {
-            ++it;
-            continue;
-        }
-        SD::PlatformUtilities::unloadLibrary(it->handle);
-        it = toLoad.erase(it);
-        ++failed;
-    }
+    unsigned int const failed = detail::loadEach(
+        toLoad, [&](libstruct& record) { return loadOne(record, counter, libs, fps, services); },
+        [](libstruct const& record, std::exception const* e) {
+            if (e)
+                FP_LOG_LOAD(6000, "myloadFPs: Exception ", e->what(), " Type=", typeid(*e).name(),
+                            " for ", record.path);
+            else
+                FP_LOG_LOAD(6000, "myloadFPs Caught exception for ", record.path);
+        });
     if (failed == 0)
         return success();
     FP_LOG(6000, "myloadFPs count of FPs that did not load ", failed);

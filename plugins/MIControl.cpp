@@ -117,27 +117,19 @@ Error MIControl::myloadMIs(unsigned short& counter, std::vector<libstruct>& libs
                            Number moduleVersion, NodeStore& store, NodeArrivalCallBack loadCB,
                            void const* context, NodeLookupCallBack getNodeCB)
 {
-    unsigned int failed = 0;
-    for (auto it = toLoad.begin(); it != toLoad.end();) {
-        bool loaded = false;
-        try {
-            loaded = loadOne(*it, counter, libs, mis, alertCB, interfaceVersion, moduleVersion,
-                             store, loadCB, context, getNodeCB, *this);
-        } catch (std::exception const& e) {
-            MI_LOG(6000, "myloadMIs: Exception ", e.what(), " Type=", typeid(e).name(), " for ",
-                   it->path);
-        } catch (...) {
-            MI_LOG(6000, "myloadMIs: ", it->path, " Exception loading library");
-        }
-        if (loaded) {
-            ++it;
-            continue;
-        }
-        // The object the library handed out, if any, is abandoned with it.
-        SD::PlatformUtilities::unloadLibrary(it->handle);
-        it = toLoad.erase(it);
-        ++failed;
-    }
+    unsigned int const failed = detail::loadEach(
+        toLoad,
+        [&](libstruct& record) {
+            return loadOne(record, counter, libs, mis, alertCB, interfaceVersion, moduleVersion,
+                           store, loadCB, context, getNodeCB, *this);
+        },
+        [](libstruct const& record, std::exception const* e) {
+            if (e)
+                MI_LOG_LOAD(6000, "myloadMIs: Exception ", e->what(), " Type=", typeid(*e).name(),
+                            " for ", record.path);
+            else
+                MI_LOG_LOAD(6000, "myloadMIs: ", record.path, " Exception loading library");
+        });
     if (failed == 0)
         return success();
     MI_LOG(6000, "myloadMIs count of MIs that did not load ", failed);
