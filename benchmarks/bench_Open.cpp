@@ -1,12 +1,17 @@
 // The first Open and its Unloadlib with 64 management interfaces, against
 // what any loader must do at least: dlopen the same 64 files, find
-// "OpenMI", call it, release the object and close the library.
+// "OpenMI", call it, release the object and close the library. A second
+// baseline adds the least that a check of the files which cannot be raced
+// needs: the directory opened once, each file's status taken in it, the file
+// opened and compared with that status, and loaded through its descriptor.
 #include <IC/InstrumentationControl.h>
 #include <IC/ManagementInterface.h>
 
 #include <benchmark/benchmark.h>
 
 #include <dlfcn.h>
+#include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -88,6 +93,43 @@ void BM_OpenUnloadBaseline(benchmark::State& state)
     }
 }
 BENCHMARK(BM_OpenUnloadBaseline)->Unit(benchmark::kMillisecond);
+
+void BM_OpenUnloadCheckedBaseline(benchmark::State& state)
+{
+    Dirs const& d = dirs();
+    for (auto _ : state) {
+        int const dir = open(d.mi.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+        std::vector<void*> handles;
+        std::vector<int> fds;
+        std::vector<IC::ManagementInterface*> mis;
+        for (std::string const& file : d.files) {
+            std::string const name = fs::path(file).filename().string();
+            struct stat before {}, after {};
+            fstatat(dir, name.c_str(), &before, AT_SYMLINK_NOFOLLOW);
+            int const fd = openat(dir, name.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC);
+            fstat(fd, &after);
+            if (before.st_ino != after.st_ino || !S_ISREG(after.st_mode))
+                state.SkipWithError("file changed");
+            std::string const proc = "/proc/self/fd/" + std::to_string(fd);
+            void* handle = dlopen(proc.c_str(), RTLD_NOW | RTLD_LOCAL);
+            auto open = reinterpret_cast<IC::OpenMIFunction>(dlsym(handle, "OpenMI"));
+            IC::ManagementInterface* mi = nullptr;
+            IC::Error* err = nullptr;
+            open(&mi, &err);
+            handles.push_back(handle);
+            fds.push_back(fd);
+            mis.push_back(mi);
+        }
+        for (auto it = mis.rbegin(); it != mis.rend(); ++it)
+            (*it)->release();
+        for (auto it = handles.rbegin(); it != handles.rend(); ++it)
+            dlclose(*it);
+        for (int fd : fds)
+            close(fd);
+        close(dir);
+    }
+}
+BENCHMARK(BM_OpenUnloadCheckedBaseline)->Unit(benchmark::kMillisecond);
 
 } // namespace
 
