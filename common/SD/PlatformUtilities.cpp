@@ -2,6 +2,7 @@
 
 #include <HGLog/HGLogger.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
@@ -51,13 +52,58 @@ constexpr int LEVEL_PROGRESS = 3000;
 
 char const* const kTrustVariable = "IC_PLUGIN_TRUST";
 
-// An installation can be relocated without rebuilding: the environment wins
-// when it says something, and is consulted on every call so that a host may
-// change it while running.
-std::string fromEnvironment(char const* variable, char const* fallback)
+std::string resolvedPath(char const* path)
+{
+    std::unique_ptr<char, decltype(&std::free)> const real(realpath(path, nullptr), &std::free);
+    return real ? std::string(real.get()) : std::string();
+}
+
+// The directory the installed library was loaded from, resolved; empty in
+// the build tree or when the loader does not say.
+std::string const& installedLibraryDirectory()
+{
+    static std::string const directory = [] {
+        Dl_info info{};
+        if (dladdr(reinterpret_cast<void*>(&PlatformUtilities::getSeparator), &info) == 0 ||
+            info.dli_fname == nullptr)
+            return std::string();
+        std::string const file = resolvedPath(info.dli_fname);
+        std::string const here = file.substr(0, file.rfind('/'));
+        return here == resolvedPath(IC_BUILD_LIBDIR) ? std::string() : here;
+    }();
+    return directory;
+}
+
+// An installed library finds its directories relative to itself, wherever
+// the installed tree was put; in the build tree, or for a directory
+// configured outside the prefix, the configured path holds.
+std::string installedDirectory(char const* fromLibraryDirectory, char const* configured)
+{
+    std::string const& here = installedLibraryDirectory();
+    if (*fromLibraryDirectory == '\0' || here.empty())
+        return configured;
+    std::string directory = here;
+    // Lexically: "lib/../var" becomes "var", so that texts show a plain path.
+    for (char const* part = fromLibraryDirectory; *part != '\0';) {
+        char const* const end = std::strchr(part, '/');
+        std::string const name(part, end ? static_cast<std::size_t>(end - part) : std::strlen(part));
+        if (name == "..")
+            directory.erase(std::max<std::size_t>(directory.rfind('/'), 1));
+        else if (!name.empty() && name != ".")
+            directory += (directory == "/" ? "" : "/") + name;
+        part = end ? end + 1 : part + name.size();
+    }
+    return directory;
+}
+
+// The environment wins when it says something, and is consulted on every
+// call so that a host may change it while running.
+std::string fromEnvironment(char const* variable, char const* fromLibraryDirectory,
+                            char const* configured)
 {
     char const* value = std::getenv(variable);
-    return (value != nullptr && *value != '\0') ? std::string(value) : std::string(fallback);
+    return (value != nullptr && *value != '\0') ? std::string(value)
+                                                 : installedDirectory(fromLibraryDirectory, configured);
 }
 
 // Read on every load, like the directories, so that a developer can flip it
@@ -605,17 +651,17 @@ char PlatformUtilities::getSeparator()
 
 std::string PlatformUtilities::getBriscaDataDir()
 {
-    return fromEnvironment("IC_DATA_DIR", IC_DEFAULT_DATA_DIR);
+    return fromEnvironment("IC_DATA_DIR", IC_DATA_DIR_FROM_LIBDIR, IC_DEFAULT_DATA_DIR);
 }
 
 std::string PlatformUtilities::getBriscaMIDir()
 {
-    return fromEnvironment("IC_MI_DIR", IC_DEFAULT_MI_DIR);
+    return fromEnvironment("IC_MI_DIR", IC_MI_DIR_FROM_LIBDIR, IC_DEFAULT_MI_DIR);
 }
 
 std::string PlatformUtilities::getBriscaFPDir()
 {
-    return fromEnvironment("IC_FP_DIR", IC_DEFAULT_FP_DIR);
+    return fromEnvironment("IC_FP_DIR", IC_FP_DIR_FROM_LIBDIR, IC_DEFAULT_FP_DIR);
 }
 
 _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
