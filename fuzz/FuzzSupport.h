@@ -5,6 +5,7 @@
 
 #include <IC/NodeStore.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -23,6 +24,15 @@ inline IC::NodeStore const& store()
 {
     std::fprintf(stderr, "%s:%d: property failed: %s\n", file, line, what);
     std::abort();
+}
+
+// A sensor type that no pair has: a stop type that stops nothing.
+inline std::uint32_t absentType(IC::NodeStore::TopoVec const& pairs)
+{
+    std::uint32_t t = 0xFFFFFFFFu;
+    while (std::any_of(pairs.begin(), pairs.end(), [t](auto const& p) { return p.first == t; }))
+        --t;
+    return t;
 }
 
 // Little-endian 32-bit value at p.

@@ -47,15 +47,6 @@ TopoVec reference(std::string const& uid, std::optional<std::uint32_t> stop)
     return pairs;
 }
 
-// A type that no pair has.
-std::uint32_t absentType(TopoVec const& pairs)
-{
-    std::uint32_t t = 0xFFFFFFFFu;
-    while (std::any_of(pairs.begin(), pairs.end(), [t](auto const& p) { return p.first == t; }))
-        --t;
-    return t;
-}
-
 } // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(std::uint8_t const* data, std::size_t size)
@@ -84,13 +75,13 @@ extern "C" int LLVMFuzzerTestOneInput(std::uint8_t const* data, std::size_t size
     FUZZ_CHECK(decoded == reference(uid, stop));
 
     TopoVec all;
-    store.uniqueid2topovec(uid, absentType(reference(uid, std::nullopt)), all);
+    store.uniqueid2topovec(uid, fuzz::absentType(reference(uid, std::nullopt)), all);
     FUZZ_CHECK(all == reference(uid, std::nullopt));
     if (all.empty())
         return 0;
     std::string const code = store.nodecode(all);
     TopoVec again;
-    store.uniqueid2topovec(code, absentType(all), again);
+    store.uniqueid2topovec(code, fuzz::absentType(all), again);
     FUZZ_CHECK(again == all);
     return 0;
 }

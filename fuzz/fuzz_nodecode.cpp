@@ -24,14 +24,6 @@ std::size_t digitCount(std::uint32_t n)
     return count;
 }
 
-std::uint32_t absentType(TopoVec const& pairs)
-{
-    std::uint32_t t = 0xFFFFFFFFu;
-    while (std::any_of(pairs.begin(), pairs.end(), [t](auto const& p) { return p.first == t; }))
-        --t;
-    return t;
-}
-
 } // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(std::uint8_t const* data, std::size_t size)
@@ -61,7 +53,7 @@ extern "C" int LLVMFuzzerTestOneInput(std::uint8_t const* data, std::size_t size
     FUZZ_CHECK(code.find('\0') == std::string::npos);
 
     TopoVec decoded;
-    store.uniqueid2topovec(code, absentType(pairs), decoded);
+    store.uniqueid2topovec(code, fuzz::absentType(pairs), decoded);
     FUZZ_CHECK(decoded == pairs);
 
     // Stopping at a type that occurs: the pairs up to its first occurrence.
