@@ -12,73 +12,59 @@ namespace {
 
 namespace ICC = IC::InstCtrl;
 using IC::Alert;
-using IC::Node;
 using Paths = std::vector<std::string>;
-using ST = Node::SensorType;
+using ST = IC::Node::SensorType;
 
-constexpr int kOps = 2000;           // operations per thread
-constexpr unsigned char kFromMI = 1; // severity marking management batches
-constexpr unsigned char kFromFP = 2; // severity marking plug-in batches
+constexpr int kOps = 2000; // operations per thread
+constexpr unsigned char kFromMI = 1, kFromFP = 2; // severities that mark the source
 Alert::ClassType const kWatched = static_cast<Alert::ClassType>(7);
 
 // The message of every alert raised here is its number of paths, so that a
 // receiver can tell whether it got all of them.
-Alert alertFrom(unsigned char source, unsigned int c, Paths paths, unsigned int status)
+Alert raised(unsigned char source, unsigned int c, Paths paths, unsigned int status)
 {
     std::string const n = std::to_string(paths.size());
     return Alert(source, static_cast<Alert::ClassType>(c), std::move(paths), status, n);
 }
 
-std::set<std::string> gCpuPaths, gFanPaths; // fixed after set-up
+enum class Form { ClientSensor, ClientClass, ClientPaths, PlugInSensor, PlugInPaths, Simple };
 
-enum class Form { ClientSensor, ClientClass, ClientPaths, PlugInSensor, PlugInPaths };
-
-// One subscriber with a single, fixed filter.
+// One subscriber with a single, fixed filter: the paths it may receive (its
+// sensor type's or its own). One that removes itself does so from inside
+// each delivery.
 struct Watch {
     Form form;
-    IC::AlertCallBack cb;
+    std::set<std::string> allowed = {};
     ST sensor = ST::CPU;
-    Paths paths = {};
-    std::atomic<long> calls{0}, alerts{0}, fromMI{0}, bad{0};
-
-    void check(std::vector<Alert> const& batch)
-    {
-        ++calls;
-        bool const client = form <= Form::ClientPaths;
-        for (auto const& a : batch) {
-            ++alerts;
-            fromMI += a.getSeverity() == kFromMI;
-            bad += a.getSeverity() == kFromMI && client; // clients only see what plug-ins raise
-            Paths const& got = a.nodePaths();
-            if (form == Form::ClientClass) {
-                bad += a.getClass() != kWatched || std::to_string(got.size()) != a.getMessage();
-                continue;
-            }
-            bad += got.empty();
-            bool const bySensor = form == Form::ClientSensor || form == Form::PlugInSensor;
-            for (auto const& p : got)
-                bad += bySensor ? (sensor == ST::CPU ? gCpuPaths : gFanPaths).count(p) == 0
-                                : std::find(paths.begin(), paths.end(), p) == paths.end();
-        }
-    }
+    bool removesItself = false;
+    std::atomic<long> calls{0}, alerts{0}, fromMI{0}, bad{0}, selfRemovals{0};
 };
 
-template <unsigned char Status>
-IC::Error watch(std::vector<Alert> const& a, void const* ctx)
+IC::Error watch(std::vector<Alert> const& batch, void const* ctx)
 {
-    static_cast<Watch*>(const_cast<void*>(ctx))->check(a);
-    return IC::Error(Status, IC::Number(IC::Number::Generic), "");
+    auto& w = *static_cast<Watch*>(const_cast<void*>(ctx));
+    ++w.calls;
+    for (auto const& a : batch) {
+        ++w.alerts;
+        w.fromMI += a.getSeverity() == kFromMI;
+        w.bad += a.getSeverity() == kFromMI && w.form <= Form::ClientPaths; // clients see only plug-ins' alerts
+        if (w.form == Form::ClientClass)
+            w.bad += a.getClass() != kWatched || std::to_string(a.nodePaths().size()) != a.getMessage();
+        else
+            w.bad += a.nodePaths().empty() ||
+                std::any_of(a.nodePaths().begin(), a.nodePaths().end(),
+                            [&w](auto const& p) { return w.allowed.count(p) == 0; });
+    }
+    if (w.removesItself)
+        w.selfRemovals += ICC::deRegFPsensorAlerts(watch, w.sensor, ctx).getStatus() == 0;
+    return IC::Error(static_cast<unsigned char>(w.calls % 2), IC::Number(IC::Number::Generic), "ignored");
 }
 
-std::atomic<long> gSelfRemovals{0};
-
-// Drops its own registration from inside the delivery.
-IC::Error selfRemoving(std::vector<Alert> const& a, void const* ctx)
+void simpleWatch(unsigned int code, SD::DateTime, std::string path, void const* ctx)
 {
-    auto* w = static_cast<Watch*>(const_cast<void*>(ctx));
-    w->check(a);
-    gSelfRemovals += ICC::deRegFPsensorAlerts(selfRemoving, w->sensor, ctx).getStatus() == 0;
-    return IC::Error(0, IC::Number(IC::Number::Generic), "");
+    auto& w = *static_cast<Watch*>(const_cast<void*>(ctx));
+    ++w.calls;
+    w.bad += code > 2 || w.allowed.count(path) == 0;
 }
 
 bool ok(IC::Error const& e) { return e.getStatus() == 0; }
@@ -86,162 +72,117 @@ bool ok(IC::Error const& e) { return e.getStatus() == 0; }
 // Registers (on) or deregisters the watch in its form; true on success.
 bool subscribe(IC::InstrumentationControl& ic, Watch& w, bool on)
 {
+    Paths const paths(w.allowed.begin(), w.allowed.end());
     switch (w.form) {
     case Form::ClientSensor:
-        return ok(on ? ic.registerForAlerts(w.cb, w.sensor, &w) : ic.deRegisterForAlerts(w.cb, w.sensor, &w));
+        return ok(on ? ic.registerForAlerts(watch, w.sensor, &w) : ic.deRegisterForAlerts(watch, w.sensor, &w));
     case Form::ClientClass:
-        return ok(on ? ICC::registerForAlerts(w.cb, kWatched, &w) : ICC::deRegisterForAlerts(w.cb, kWatched, &w));
+        return ok(on ? ICC::registerForAlerts(watch, kWatched, &w) : ICC::deRegisterForAlerts(watch, kWatched, &w));
     case Form::ClientPaths:
-        return ok(on ? ICC::registerForAlerts(w.cb, w.paths, &w) : ICC::deRegisterForAlerts(w.cb, w.paths, &w));
+        return ok(on ? ICC::registerForAlerts(watch, paths, &w) : ICC::deRegisterForAlerts(watch, paths, &w));
     case Form::PlugInSensor:
-        return ok(on ? ICC::regFPsensorAlerts(w.cb, w.sensor, &w) : ICC::deRegFPsensorAlerts(w.cb, w.sensor, &w));
+        return ok(on ? ICC::regFPsensorAlerts(watch, w.sensor, &w) : ICC::deRegFPsensorAlerts(watch, w.sensor, &w));
+    case Form::PlugInPaths:
+        return ok(on ? ICC::regFPAlerts(watch, paths, &w) : ICC::deRegFPAlerts(watch, paths, &w));
     default:
-        return ok(on ? ICC::regFPAlerts(w.cb, w.paths, &w) : ICC::deRegFPAlerts(w.cb, w.paths, &w));
+        return ok(on ? ic.registerForSimpleAlerts(simpleWatch, w.sensor, &w)
+                     : ic.deRegisterForSimpleAlerts(simpleWatch, w.sensor, &w));
     }
 }
-
-struct SimpleWatch {
-    std::set<std::string> const* paths;
-    std::atomic<long> calls{0}, bad{0};
-};
-
-void simpleWatch(unsigned int code, SD::DateTime, std::string path, void const* ctx)
-{
-    auto* w = static_cast<SimpleWatch*>(const_cast<void*>(ctx));
-    ++w->calls;
-    w->bad += code > 2 || w->paths->count(path) == 0;
-}
-
-class AlertStress : public testing::Test {
-protected:
-    void SetUp() override
-    {
-        // Thousands of warnings would otherwise go to standard error.
-        std::string const conf = testing::TempDir() + "alert_stress_log.properties";
-        std::ofstream(conf) << "log4j.rootLogger=OFF\n";
-        ASSERT_TRUE(HGLog::HGLogger::configure(conf));
-        std::remove(conf.c_str());
-        gCpuPaths = std::set<std::string>(cpu.begin(), cpu.end());
-        gFanPaths = std::set<std::string>(fan.begin(), fan.end());
-        ASSERT_EQ(gCpuPaths.size() + gFanPaths.size(), 12u);
-    }
-    void TearDown() override { HGLog::HGLogger::configureDefault(); }
-
-    ictest::CleanAlertState clean_;
-    ictest::NodeTree tree{ICC::nodestore, 8, 4};
-    Paths const &cpu = tree.cpu, &fan = tree.fan;
-};
 
 } // namespace
 
-TEST_F(AlertStress, RegistrationsDispatchAndQueriesInterleaveSafely)
+TEST(AlertStress, RegistrationsDispatchAndQueriesInterleaveSafely)
 {
-    IC::InstrumentationControl ic;
-    // CPU 6 and 7 and fan 3 are removed and re-added.
-    std::vector<Node*> const removable{tree.nodes[7].get(), tree.nodes[8].get(), tree.nodes[12].get()};
-    Watch longClient{Form::ClientSensor, watch<0>}, longPlugIn{Form::PlugInSensor, watch<1>};
-    Watch self{Form::PlugInSensor, selfRemoving};
-    Watch clientSensor{Form::ClientSensor, watch<1>}, clientClass{Form::ClientClass, watch<0>};
-    Watch clientPaths{Form::ClientPaths, watch<1>, ST::CPU, {cpu[1], fan[0], cpu[7]}};
-    Watch plugInSensor{Form::PlugInSensor, watch<0>, ST::Fan};
-    Watch plugInPaths{Form::PlugInPaths, watch<0>, ST::CPU, {cpu[2], fan[3]}};
-    SimpleWatch simpleLong{&gFanPaths}, simpleToggled{&gCpuPaths};
-    for (Watch* w : {&longClient, &longPlugIn, &self})
-        ASSERT_TRUE(subscribe(ic, *w, true));
-    ASSERT_EQ(ic.registerForSimpleAlerts(simpleWatch, ST::Fan, &simpleLong).getStatus(), 0);
+    ictest::CleanAlertState clean;
+    ictest::NodeTree tree{ICC::nodestore, 8, 4};
+    Paths const &cpu = tree.cpu, &fan = tree.fan;
+    std::set<std::string> const cpus(cpu.begin(), cpu.end()), fans(fan.begin(), fan.end());
+    // Thousands of warnings would otherwise go to standard error.
+    std::string const conf = testing::TempDir() + "alert_stress_log.properties";
+    std::ofstream(conf) << "log4j.rootLogger=OFF\n";
+    ASSERT_TRUE(HGLog::HGLogger::configure(conf));
+    std::remove(conf.c_str());
 
-    std::atomic<long> failures{0}, removals{0};
+    IC::InstrumentationControl ic;
+    // CPU 6 and 7 and fan 3 are removed and come back.
+    std::vector<IC::Node*> const removable{tree.nodes[7].get(), tree.nodes[8].get(), tree.nodes[12].get()};
+    Watch longClient{Form::ClientSensor, cpus}, longPlugIn{Form::PlugInSensor, cpus}, self{Form::PlugInSensor, cpus};
+    Watch simpleLong{Form::Simple, fans, ST::Fan}, simpleToggled{Form::Simple, cpus};
+    Watch clientSensor{Form::ClientSensor, cpus}, clientClass{Form::ClientClass};
+    Watch clientPaths{Form::ClientPaths, {cpu[1], fan[0], cpu[7]}}, plugInPaths{Form::PlugInPaths, {cpu[2], fan[3]}};
+    Watch plugInSensor{Form::PlugInSensor, fans, ST::Fan};
+    self.removesItself = true;
+    for (Watch* w : {&longClient, &longPlugIn, &self, &simpleLong})
+        ASSERT_TRUE(subscribe(ic, *w, true));
+
+    std::atomic<long> failures{0};
     std::atomic<bool> go{false};
     std::atomic<int> sourcesRunning{2};
-    // Registration and query threads keep going while alerts still flow, so
-    // that the two overlap however the threads are scheduled.
-    auto more = [&](int i) { return i < kOps || (sourcesRunning.load() > 0 && i < 20 * kOps); };
     auto waitForStart = [&go] {
         while (!go.load())
             std::this_thread::yield();
     };
-    // Each toggles its subscriptions: on at one visit, off at the next.
-    auto toggler = [&](std::vector<Watch*> mine, bool feedSelf) {
+    // Each toggles its subscriptions, on at one visit and off at the next,
+    // and goes on while alerts still flow, so that both overlap however the
+    // threads are scheduled; one also reads the asserted alerts.
+    auto toggler = [&](std::vector<Watch*> mine, bool feedSelf, bool reads) {
         waitForStart();
         std::vector<bool> on(mine.size(), false);
-        for (int i = 0; more(i); ++i) {
+        for (int i = 0; i < kOps || (sourcesRunning.load() > 0 && i < 20 * kOps); ++i) {
             std::size_t const k = static_cast<std::size_t>(i) % mine.size();
             on[k] = !on[k];
-            failures += !subscribe(ic, *mine[k], on[k]);
-            failures += feedSelf && i % 4 == 0 && !subscribe(ic, self, true);
+            failures += !subscribe(ic, *mine[k], on[k]) + (feedSelf && i % 4 == 0 && !subscribe(ic, self, true));
+            std::vector<Alert> out;
+            failures += reads && i % 2 == 0 && !ok(ic.getAssertedAlerts(out));
+            for (auto const& a : out)
+                failures += a.getStatus() == 1 || a.getNodePaths().empty();
         }
         for (std::size_t k = 0; k < mine.size(); ++k)
             failures += on[k] && !subscribe(ic, *mine[k], false);
     };
     auto source = [&](bool fromFP) {
         waitForStart();
-        for (std::size_t i = 0; i < kOps; ++i) {
+        for (int i = 0; i < kOps; ++i) {
             std::string const &c = cpu[i % 8], &f = fan[i % 4];
             if (!fromFP) {
-                std::vector<Alert> const batch{alertFrom(kFromMI, 0, {c}, 2), alertFrom(kFromMI, kWatched, {c, f}, 3),
-                                               alertFrom(kFromMI, 5, {f}, 2)};
-                failures += !ok(ICC::AlertCallBackMI(batch, nullptr));
+                failures += !ok(ICC::AlertCallBackMI(
+                    {raised(kFromMI, 0, {c}, 2), raised(kFromMI, kWatched, {c, f}, 3), raised(kFromMI, 5, {f}, 2)},
+                    nullptr));
                 continue;
             }
-            failures += ICC::AlertCallBackFP({alertFrom(kFromFP, 0, {c}, i % 2 ? 1u : 2u),
-                                              alertFrom(kFromFP, kWatched, {cpu[(i + 3) % 8], f}, 2),
-                                              alertFrom(kFromFP, 5, {f}, 0)}).getStatus() != 0;
-            if (i % 10 == 0)
-                failures += ICC::AssertCallBackFP({alertFrom(kFromFP, 0, {c}, 3)}).getStatus() != 0;
+            failures += !ok(ICC::AlertCallBackFP({raised(kFromFP, 0, {c}, i % 2 ? 1u : 2u),
+                                                  raised(kFromFP, kWatched, {cpu[(i + 3) % 8], f}, 2),
+                                                  raised(kFromFP, 5, {f}, 0)}));
+            failures += i % 10 == 0 && !ok(ICC::AssertCallBackFP({raised(kFromFP, 0, {c}, 3)}));
             if (i % 16 == 0) {
-                Node* n = removable[(i / 16) % removable.size()];
+                IC::Node* n = removable[(i / 16) % removable.size()];
                 std::string const path = n->getPath();
-                failures += ICC::AlertCallBackFP({alertFrom(kFromFP, 4, {path}, 2)}).getStatus() != 0;
-                Node* found = nullptr;
-                failures += ICC::nodestore.getNode(path, &found).getStatus() != 1;
-                failures += !ictest::addNew(ICC::nodestore, *n);
-                ++removals;
+                failures += !ok(ICC::AlertCallBackFP({raised(kFromFP, 4, {path}, 2)}));
+                failures += ICC::nodestore.nodePathToSensor(path) != ST::invalid || !ictest::addNew(ICC::nodestore, *n);
             }
         }
         --sourcesRunning;
     };
-    auto reader = [&] {
-        waitForStart();
-        bool on = false;
-        std::vector<Alert> out;
-        for (int i = 0; more(i); ++i) {
-            failures += i % 2 == 0 && ic.getAssertedAlerts(out).getStatus() != 0;
-            for (auto const& a : out)
-                failures += a.getStatus() == 1 || a.getNodePaths().empty();
-            on = !on;
-            failures += (on ? ic.registerForSimpleAlerts(simpleWatch, ST::CPU, &simpleToggled)
-                            : ic.deRegisterForSimpleAlerts(simpleWatch, ST::CPU, &simpleToggled)).getStatus() != 0;
-        }
-        failures += on && ic.deRegisterForSimpleAlerts(simpleWatch, ST::CPU, &simpleToggled).getStatus() != 0;
-    };
     {
         ictest::Watchdog dog(240, "alert stress test (deadlock?)");
-        ictest::JoinedThread t1(toggler, std::vector<Watch*>{&clientSensor, &clientClass, &clientPaths}, false);
-        ictest::JoinedThread t2(toggler, std::vector<Watch*>{&plugInSensor, &plugInPaths}, true);
-        ictest::JoinedThread t3(source, false), t4(source, true), t5(reader);
+        ictest::JoinedThread t1(toggler, std::vector<Watch*>{&clientSensor, &clientClass, &clientPaths}, false, false);
+        ictest::JoinedThread t2(toggler, std::vector<Watch*>{&plugInSensor, &plugInPaths}, true, false);
+        ictest::JoinedThread t3(source, false), t4(source, true),
+            t5(toggler, std::vector<Watch*>{&simpleToggled}, false, true);
         go = true;
     }
+    HGLog::HGLogger::configureDefault();
 
     EXPECT_EQ(failures.load(), 0);
-    EXPECT_TRUE(subscribe(ic, longClient, false) && subscribe(ic, longPlugIn, false));
-    subscribe(ic, self, false); // may already have removed itself
-    EXPECT_EQ(ic.deRegisterForSimpleAlerts(simpleWatch, ST::Fan, &simpleLong).getStatus(), 0);
+    for (Watch* w : {&longClient, &longPlugIn, &simpleLong})
+        EXPECT_TRUE(subscribe(ic, *w, false));
+    subscribe(ic, self, false); // may have removed itself already
     EXPECT_TRUE(ictest::noRegistrations());
-    for (Watch* w :
-         {&longClient, &longPlugIn, &self, &clientSensor, &clientClass, &clientPaths, &plugInSensor, &plugInPaths})
+    for (Watch* w : {&longClient, &longPlugIn, &self, &simpleLong, &simpleToggled, &clientSensor, &clientClass,
+                     &clientPaths, &plugInSensor, &plugInPaths})
         EXPECT_EQ(w->bad.load(), 0) << "a callback received alerts outside its filter";
-    EXPECT_EQ(simpleLong.bad.load() + simpleToggled.bad.load(), 0);
     // The long-lived subscriptions saw the traffic they asked for.
-    EXPECT_GT(longClient.alerts.load(), 0);
-    EXPECT_EQ(longClient.fromMI.load(), 0);
-    EXPECT_GT(longPlugIn.fromMI.load(), 0);
-    EXPECT_GT(longPlugIn.alerts.load() - longPlugIn.fromMI.load(), 0);
-    EXPECT_GT(simpleLong.calls.load(), 0);
-    EXPECT_EQ(removals.load(), (kOps + 15) / 16);
-    EXPECT_GT(self.calls.load(), 0);
-    EXPECT_GT(gSelfRemovals.load(), 0);
-    std::vector<Alert> left;
-    ic.getAssertedAlerts(left);
-    for (auto const& a : left)
-        EXPECT_NE(a.getStatus(), 1u);
+    EXPECT_TRUE(longClient.alerts > 0 && longClient.fromMI == 0 && simpleLong.calls > 0 && self.selfRemovals > 0);
+    EXPECT_TRUE(longPlugIn.fromMI > 0 && longPlugIn.alerts > longPlugIn.fromMI);
 }
