@@ -309,6 +309,75 @@ TEST_F(HealthTest, LinuxHwReadingsCrossingAThresholdAreAssertedAndCleared)
     EXPECT_TRUE(ictest::eventually([&] { return asserted().empty(); }, 8000));
 }
 
+TEST_F(HealthTest, LinuxHwConditionsPresentAtStartAreAssertedWhenOpenReturns)
+{
+    fs::remove(mi_ / "fakehw.so");
+    fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
+    ictest::EnvGuard poll("IC_LINUXHW_POLL_MS", "50");
+    std::string const dimm = "DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0";
+    std::string const chassis = "System Acme Computers Rack R720";
+    // What getAssertedAlerts lists at once, by node description.
+    std::map<std::string, std::map<std::string, std::string>> const trees = {
+        {"small", {}},
+        {"large", {{chassis, "8/2/"}, {dimm, "6/2/" + dimm + ": 2 corrected memory errors counted"}}},
+        {"degraded",
+         {{chassis, "8/3/"},
+          {dimm, "6/2/" + dimm + ": 2 corrected memory errors counted"},
+          {"DIMM CPU_SrcID#0_MC#0_Chan#3_DIMM#0", "6/3/DIMM CPU_SrcID#0_MC#0_Chan#3_DIMM#0: 1 uncorrected memory errors counted"},
+          {"Power supply PSU2 (Mains)", "5/3/Power supply PSU2 (Mains) has no input power"},
+          {"Disk sdb: ST4000NM0035-1V4 (4001 GB)", "5/3/Disk sdb: ST4000NM0035-1V4 (4001 GB) is offline"},
+          {"nct6779 fan3 speed", "5/2/nct6779 fan3 speed 0 RPM below warning 600 RPM"},
+          {"CPU 1 Core 1 temperature", "5/3/CPU 1 Core 1 temperature: hwmon alarm temp3_crit_alarm is set"}}},
+    };
+    for (auto const& [tree, expected] : trees) {
+        SCOPED_TRACE(tree);
+        fs::path const root = dir_.path("root-" + tree);
+        fs::copy(fs::path(IC_EXAMPLES_DIR) / tree, root, fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+        ictest::EnvGuard sysfs("IC_SYSFS_ROOT", root.string());
+        IC::Error* err = nullptr;
+        ASSERT_EQ(Open(&ic_, &err), 0);
+        auto byNode = [this] {
+            std::map<std::string, std::string> out;
+            for (auto const& [path, text] : asserted()) {
+                Node* n = nullptr;
+                ic_->getNode(path, &n);
+                out[n ? n->getDescription() : path] = text;
+            }
+            return out;
+        };
+        EXPECT_EQ(byNode(), expected);
+        // Every node's state agrees with what is asserted on it.
+        std::map<std::string, std::string> const now = asserted();
+        std::vector<Node*> all;
+        ic_->getAllNodes(all);
+        for (Node* n : all) {
+            Node::Property state;
+            auto const a = now.find(n->getPath());
+            std::string const level = a == now.end() || a->second[0] == '8' ? "" : a->second.substr(2, 1);
+            n->getProperty("state", &state);
+            EXPECT_EQ(level, state.value == "critical" ? "3" : state.value == "warning" ? "2" : "") << n->getDescription();
+        }
+        // A poll has run (the reading moved) and raised nothing again.
+        void const* conditions = watch(shipped::kThreshold);
+        void const* memory = watch(shipped::kMemoryErrors);
+        std::ofstream(root / "t.new") << "41000\n";
+        fs::rename(root / "t.new", root / "sys/class/hwmon/hwmon0/temp2_input");
+        EXPECT_TRUE(ictest::eventually(
+            [&] {
+                Node::Property p;
+                for (Node* n : all)
+                    if (n->getDescription() == "CPU 0 Core 0 temperature")
+                        return n->getProperty("reading", &p) && p.value == "41.0";
+                return false;
+            },
+            8000));
+        EXPECT_TRUE(got(conditions).empty() && got(memory).empty()) << ::testing::PrintToString(got(conditions));
+        EXPECT_EQ(byNode(), expected);
+        Unloadlib();
+        ic_ = nullptr;
+    }
+}
+
 #endif // LINUXHW_PLUGIN
 
 } // namespace

@@ -20,9 +20,21 @@
 //
 // Severities: 0 information, 1 warning, 2 critical, 3 fatal.
 // Status: 1 normal (clears the path's asserted alert); 2 warning; 3 critical.
+//
+// A node also says what is wrong with it, so that a functional plug-in loaded
+// after its interface can assert what was already wrong before anything could
+// be registered to hear of it: while the interface has a condition asserted on
+// the node, the node's `condition` property holds that alert's message and
+// `condition_class` its class, and `state` is "warning" (status 2) or
+// "critical" (status 3), or "unknown" while the reading cannot be taken.
 #pragma once
 
 #include <IC/Alert.h>
+#include <IC/Node.h>
+
+#include <algorithm>
+#include <string>
+#include <vector>
 
 namespace shipped {
 
@@ -41,6 +53,40 @@ constexpr unsigned char kSeverityFatal = 3;
 constexpr unsigned int kStatusNormal = 1;
 constexpr unsigned int kStatusWarning = 2;
 constexpr unsigned int kStatusCritical = 3;
+
+constexpr char const* kConditionProperty = "condition";
+constexpr char const* kConditionClassProperty = "condition_class";
+
+// The severity that goes with a status.
+inline unsigned char severityOf(unsigned int status)
+{
+    return status == kStatusCritical  ? kSeverityCritical
+           : status == kStatusWarning ? kSeverityWarning
+                                      : kSeverityInfo;
+}
+
+// The alert a node's properties say its interface has asserted on it, in the
+// shape the interface raised it, appended to out; false when they say
+// nothing is (or the node has no path yet).
+inline bool conditionOf(IC::Node const& node, std::vector<IC::Alert>& out)
+{
+    IC::Node::Property state, message, cls;
+    if (!node.getProperty("state", &state) || !node.getProperty(kConditionProperty, &message))
+        return false;
+    unsigned int const status = state.value == "critical" ? kStatusCritical
+                                : state.value == "warning" ? kStatusWarning
+                                                           : kStatusNormal;
+    std::string const path = node.getPath();
+    if (status == kStatusNormal || path.empty())
+        return false;
+    unsigned long number = kThreshold;
+    if (node.getProperty(kConditionClassProperty, &cls) && !cls.value.empty() && cls.value.size() < 4 &&
+        cls.value.find_first_not_of("0123456789") == std::string::npos)
+        number = std::min(std::stoul(cls.value), 255ul);
+    out.emplace_back(severityOf(status), static_cast<IC::Alert::ClassType>(number), std::vector<std::string>{path},
+                     status, message.value);
+    return true;
+}
 
 // A short name of a class for people ("threshold"); "class N" for others.
 inline char const* className(unsigned int cls)

@@ -89,31 +89,10 @@ IC::Error HealthPlugIn::Initialize(unsigned int, IC::ICforFP const& services)
 
     for (IC::ManagementInterface* mi : services.getMIs())
         learnOwners(mi);
-
-    // When the plug-in is loaded again by a reload, the asserted store still
-    // holds what the interfaces reported before: take it over, and the
-    // roll-up the previous instance left.
-    std::vector<IC::Alert> current;
-    ic_->getAssertedAlerts(current);
-    std::vector<std::pair<std::string, Entry>> seeded;
-    for (IC::Alert const& alert : current) {
-        for (std::string const& path : alert.nodePaths()) {
-            if (alert.getClass() == shipped::kHealthRollup) {
-                std::lock_guard<std::mutex> g(lock_);
-                raisedPath_ = path;
-                raised_ = Level{alert.getStatus(), alert.getSeverity()};
-                continue;
-            }
-            seeded.emplace_back(path, Entry{alert.getSeverity(), alert.getStatus(), ownerOf(path),
-                                            alert.getMessage()});
-        }
-    }
     {
         std::lock_guard<std::mutex> g(lock_);
-        for (auto& entry : seeded)
-            asserted_[entry.first] = std::move(entry.second);
+        ++looking_;
     }
-
     {
         std::lock_guard<std::mutex> g(gLiveLock);
         gLive[this] = Live();
@@ -131,8 +110,12 @@ IC::Error HealthPlugIn::Initialize(unsigned int, IC::ICforFP const& services)
         }
         registered_.push_back(sensor);
     }
-    HEALTH_LOG(3000, "Initialize: watching ", registered_.size(), " sensor types, ",
-               seeded.size(), " asserted alerts taken over");
+    // When the plug-in is loaded again by a reload, the asserted store still
+    // holds what the interfaces reported before: take it over, and the
+    // roll-up the previous instance left. What was wrong before anything
+    // could hear of it is on the nodes.
+    lookAtNodes(true);
+    HEALTH_LOG(3000, "Initialize: watching ", registered_.size(), " sensor types");
     publishRollup(false);
     return ok();
 }
@@ -180,6 +163,13 @@ IC::Error HealthPlugIn::updatedMis(std::vector<IC::ManagementInterface*> const& 
     // went.
     for (IC::ManagementInterface* mi : added)
         learnOwners(mi);
+    if (!added.empty()) {
+        {
+            std::lock_guard<std::mutex> g(lock_);
+            ++looking_;
+        }
+        lookAtNodes(false);
+    }
     HEALTH_LOG(3000, "updatedMis: added ", added.size(), " removed ", removed.size(),
                ", withdrew ", gone.size(), " asserted alerts");
     if (!gone.empty())
@@ -263,6 +253,8 @@ void HealthPlugIn::handle(std::vector<IC::Alert> const& alerts)
             if (a.getClass() == shipped::kNodeArrival && !rollupIsChassis_)
                 rollupPath_.clear(); // perhaps the chassis we are missing
             for (std::string const& path : a.nodePaths()) {
+                if (looking_ > 0)
+                    touched_.insert(path);
                 if (path == raisedPath_)
                     touched = true;
                 if (a.getClass() == shipped::kNodeRemoval) {
@@ -279,7 +271,7 @@ void HealthPlugIn::handle(std::vector<IC::Alert> const& alerts)
                 } else if (a.getStatus() == shipped::kStatusNormal) {
                     asserted_.erase(path);
                 } else {
-                    asserted_[path] = Entry{a.getSeverity(), a.getStatus(), owners[path],
+                    asserted_[path] = Entry{a.getClass(), a.getSeverity(), a.getStatus(), owners[path],
                                             a.getMessage()};
                 }
             }
@@ -293,6 +285,76 @@ void HealthPlugIn::handle(std::vector<IC::Alert> const& alerts)
     // An interface's alert on the chassis itself replaced the roll-up in the
     // store (one alert per path): put the roll-up back.
     publishRollup(touched);
+}
+
+void HealthPlugIn::lookAtNodes(bool fromStore)
+{
+    std::vector<IC::Alert> stored;
+    if (fromStore)
+        ic_->getAssertedAlerts(stored);
+    std::vector<IC::Node*> nodes;
+    ic_->getAllNodes(nodes);
+    std::vector<IC::Alert> found;
+    for (IC::Node* node : nodes)
+        if (node)
+            shipped::conditionOf(*node, found);
+    // Looked up before taking the lock: it calls the library.
+    std::map<std::string, unsigned int> owners;
+    for (auto const* list : {&stored, &found})
+        for (IC::Alert const& a : *list)
+            for (std::string const& path : a.nodePaths())
+                owners.emplace(path, ownerOf(path));
+
+    std::vector<IC::Alert> news;
+    {
+        std::lock_guard<std::mutex> g(lock_);
+        for (IC::Alert const& a : stored) {
+            for (std::string const& path : a.nodePaths()) {
+                if (a.getClass() == shipped::kHealthRollup) {
+                    raisedPath_ = path;
+                    raised_ = Level{a.getStatus(), a.getSeverity()};
+                } else if (touched_.count(path) == 0) {
+                    asserted_[path] = Entry{a.getClass(), a.getSeverity(), a.getStatus(), owners[path],
+                                            a.getMessage()};
+                }
+            }
+        }
+        for (IC::Alert const& a : found) {
+            std::string const& path = a.nodePaths().front();
+            if (touched_.count(path) != 0 || asserted_.count(path) != 0)
+                continue;
+            asserted_[path] = Entry{a.getClass(), a.getSeverity(), a.getStatus(), owners[path], a.getMessage()};
+            news.push_back(a);
+        }
+    }
+    if (!news.empty())
+        raise(news);
+    // An alert that came while ours were on their way is newer: the store
+    // must say what it said.
+    std::vector<IC::Alert> newer;
+    std::vector<std::string> cleared;
+    {
+        std::lock_guard<std::mutex> g(lock_);
+        for (IC::Alert const& a : news) {
+            std::string const& path = a.nodePaths().front();
+            if (touched_.count(path) == 0)
+                continue;
+            auto const e = asserted_.find(path);
+            if (e == asserted_.end())
+                cleared.push_back(path);
+            else
+                newer.emplace_back(e->second.severity, e->second.cls, std::vector<std::string>{path},
+                                   e->second.status, e->second.message);
+        }
+        if (--looking_ == 0)
+            touched_.clear();
+    }
+    if (!newer.empty())
+        assert_(newer);
+    if (!cleared.empty())
+        withdraw(cleared);
+    HEALTH_LOG(3000, "lookAtNodes: ", stored.size(), " asserted alerts taken over, ", news.size(),
+               " conditions found on the nodes");
 }
 
 void HealthPlugIn::publishRollup(bool force)

@@ -45,6 +45,7 @@ private:
 
     // One asserted condition, per node path.
     struct Entry {
+        IC::Alert::ClassType cls;
         unsigned char severity;
         unsigned int status;
         unsigned int owner;
@@ -60,6 +61,11 @@ private:
     };
 
     void handle(std::vector<IC::Alert> const& alerts);
+    // Asserts what the nodes' own state says is wrong and nobody asserted
+    // yet (conditions present before this plug-in could hear of them),
+    // after taking over the asserted store when fromStore. The caller has
+    // counted the look in looking_ before anything could be delivered.
+    void lookAtNodes(bool fromStore);
     void publishRollup(bool force);
     Level worstLocked(std::string* worstPath, std::string* worstMessage) const;
     // The chassis node nearest the root, or else the ROOT node; "" if neither.
@@ -80,6 +86,10 @@ private:
     // Guards everything below. Never held while calling the library.
     mutable std::mutex lock_;
     std::map<std::string, Entry> asserted_;
+    // While a look at the nodes is under way, the paths that alerts changed:
+    // what they say is newer than what the look saw.
+    int looking_ = 0;
+    std::set<std::string> touched_;
     std::map<IC::ManagementInterface*, std::set<unsigned int>> owners_;
     // The roll-up last raised, and where.
     Level raised_{1, 0};

@@ -49,7 +49,6 @@ void DeviceScanner::scanNetwork(DeviceList& out)
         else
             d.set("speed", "unknown");
         d.set("link", d.linkKnown ? (d.linkUp ? "up" : "down") : "unknown");
-        d.set("state", d.linkUp ? "ok" : "no link");
         out.push_back(d);
     }
 }
@@ -78,7 +77,7 @@ void DeviceScanner::scanDisks(DeviceList& out)
         std::optional<std::string> version = reader_.text(dir + "device/firmware_rev");
         if (!version)
             version = reader_.text(dir + "device/rev");
-        std::optional<long long> const sectors = reader_.integer(dir + "size");
+        std::optional<long long> const sectors = reader_.count(dir + "size");
         d.description = "Disk " + name;
         if (model && !model->empty())
             d.description += ": " + *model;
@@ -95,16 +94,31 @@ void DeviceScanner::scanDisks(DeviceList& out)
             d.set("version", *version);
         if (wwid && !wwid->empty())
             d.set("wwid", *wwid);
-        if (sectors && *sectors >= 0) {
-            // sysfs counts 512-byte sectors whatever the disk's block size.
-            long long const bytes = *sectors * 512;
+        // sysfs counts 512-byte sectors whatever the disk's block size; a
+        // count whose bytes do not fit is no size.
+        long long bytes = 0;
+        if (sectors && !__builtin_mul_overflow(*sectors, 512, &bytes)) {
             d.set("size", std::to_string(bytes), "bytes");
-            d.description += " (" + std::to_string((bytes + 500000000) / 1000000000) + " GB)";
+            d.description += " (" + std::to_string(bytes / 1000000000 + (bytes % 1000000000 >= 500000000)) + " GB)";
+        } else {
+            d.set("size", "unknown");
         }
         if (std::optional<long long> const rot = reader_.quietInteger(dir + "queue/rotational"))
             d.set("media", *rot ? "hdd" : "ssd");
-        if (std::optional<std::string> const state = reader_.text(dir + "device/state"))
-            d.set("state", *state == "running" || *state == "live" ? "ok" : *state);
+        if (std::optional<std::string> const state = reader_.text(dir + "device/state")) {
+            // SCSI says running, NVMe live; offline and dead disks are lost,
+            // the other states (blocked, resetting...) pass.
+            d.watch = Watch::Condition;
+            d.set("device_state", *state);
+            if (*state == "running" || *state == "live") {
+                d.status = shipped::kStatusNormal;
+                d.message = d.description + " is back in service";
+            } else {
+                bool const lost = *state == "offline" || *state == "transport-offline" || *state == "dead";
+                d.status = lost ? shipped::kStatusCritical : shipped::kStatusWarning;
+                d.message = d.description + " is " + *state;
+            }
+        }
         out.push_back(d);
     }
 }
@@ -137,32 +151,32 @@ void DeviceScanner::scanPowerSupplies(DeviceList& out)
             d.set("reading", milliToText(*uw / 1000, 1), "W");
         if (std::optional<long long> const uv = reader_.integer(dir + "voltage_now"))
             d.set("voltage", milliToText(*uv / 1000, 3), "V");
-        if (std::optional<long long> const pct = reader_.integer(dir + "capacity"))
+        std::optional<long long> const pct = reader_.count(dir + "capacity");
+        if (pct && *pct <= 100)
             d.set("capacity", std::to_string(*pct), "%");
+        else if (reader_.exists(dir + "capacity"))
+            d.set("capacity", "unknown");
 
         std::optional<long long> const present = reader_.integer(dir + "present");
         std::optional<long long> const online = reader_.integer(dir + "online");
         std::optional<std::string> const health = reader_.text(dir + "health");
-        d.status = shipped::kStatusNormal;
-        std::string state = "ok";
+        d.status = shipped::kStatusCritical;
         if (present && *present == 0) {
-            d.status = shipped::kStatusCritical;
             d.message = d.description + " is not present";
-            state = "absent";
         } else if (online && *online == 0 && type == "Mains") {
-            d.status = shipped::kStatusCritical;
             d.message = d.description + " has no input power";
-            state = "offline";
         } else if (health && !health->empty() && *health != "Good" && *health != "Unknown") {
-            d.status = shipped::kStatusCritical;
             d.message = d.description + " reports health '" + *health + "'";
-            state = "critical";
         } else {
+            d.status = shipped::kStatusNormal;
             d.message = d.description + " is back to normal";
         }
+        if (present)
+            d.set("present", *present == 0 ? "no" : "yes");
+        if (online)
+            d.set("online", *online == 0 ? "no" : "yes");
         if (health && !health->empty())
             d.set("health", *health);
-        d.set("state", state);
         out.push_back(d);
     }
 }

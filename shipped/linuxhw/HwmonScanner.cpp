@@ -22,9 +22,9 @@ struct Kind {
 };
 
 Kind const kKinds[] = {
-    {"temp", IC::Node::TemperatureSensor, "temperature", {"C", true, 1}},
-    {"fan", IC::Node::Fan, "speed", {"RPM", false, 0}},
-    {"in", IC::Node::VoltageSensor, "voltage", {"V", true, 3}},
+    {"temp", IC::Node::TemperatureSensor, "temperature", {"C", true, 1, true}},
+    {"fan", IC::Node::Fan, "speed", {"RPM", false, 0, false}},
+    {"in", IC::Node::VoltageSensor, "voltage", {"V", true, 3, true}},
 };
 
 // "temp3_input" -> kind temp, index 3.
@@ -103,16 +103,12 @@ void evaluate(Device& d, Reading const& r, Unit const& unit)
         // Nothing known: the last status stands.
         d.status = kStatusUnknown;
         d.message.clear();
-        d.set("state", "unknown");
         return;
     }
     d.status = status;
     d.message = status == shipped::kStatusNormal
                     ? d.description + " back to normal at " + show(*r.value, unit) + " " + u
                     : why;
-    d.set("state", status == shipped::kStatusCritical  ? "critical"
-                   : status == shipped::kStatusWarning ? "warning"
-                                                       : "ok");
 }
 
 std::size_t HwmonScanner::scanHwmon(DeviceList& out)
@@ -161,8 +157,10 @@ std::size_t HwmonScanner::scanHwmon(DeviceList& out)
             chipHash = 1; // keeps instances clear of the thermal zones' 0..255
 
         std::set<std::string> const present(files.begin(), files.end());
-        auto const file = [&](std::string const& f) -> std::optional<long long> {
-            return present.count(f) != 0 ? reader_.integer(attrDir + "/" + f) : std::nullopt;
+        auto const file = [&](std::string const& f, bool canBeNegative) -> std::optional<long long> {
+            if (present.count(f) == 0)
+                return std::nullopt;
+            return canBeNegative ? reader_.integer(attrDir + "/" + f) : reader_.count(attrDir + "/" + f);
         };
         auto const label = [&](std::string const& prefix) -> std::string {
             std::optional<std::string> l;
@@ -219,17 +217,19 @@ std::size_t HwmonScanner::scanHwmon(DeviceList& out)
             d.set("label", l);
             d.set("chip", *name);
             Reading r;
-            r.value = file(f);
-            r.lowerCritical = file(prefix + "_lcrit");
-            r.lowerWarning = file(prefix + "_min");
-            r.upperWarning = file(prefix + "_max");
-            r.upperCritical = file(prefix + "_crit");
+            bool const signedValue = kind->unit.canBeNegative;
+            r.value = file(f, signedValue);
+            r.lowerCritical = file(prefix + "_lcrit", signedValue);
+            r.lowerWarning = file(prefix + "_min", signedValue);
+            r.upperWarning = file(prefix + "_max", signedValue);
+            r.upperCritical = file(prefix + "_crit", signedValue);
             std::pair<char const*, bool> const alarms[] = {
                 {"_alarm", false}, {"_min_alarm", false}, {"_max_alarm", false},
                 {"_fault", false}, {"_lcrit_alarm", true}, {"_crit_alarm", true}};
             for (auto const& a : alarms) {
-                std::optional<long long> const set = file(prefix + a.first);
-                if (set && *set != 0)
+                // Anything but 0 and 1 is no answer.
+                std::optional<long long> const set = file(prefix + a.first, false);
+                if (set && *set == 1)
                     r.alarms.emplace_back(prefix + a.first, a.second);
             }
             evaluate(d, r, kind->unit);

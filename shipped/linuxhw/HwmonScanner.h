@@ -40,6 +40,7 @@ struct Unit {
     char const* name;
     bool milli;
     int decimals;
+    bool canBeNegative; // temperatures and voltages; a negative fan speed is garbage
 };
 
 // Sets the reading, thresholds and state of d and its status and message.

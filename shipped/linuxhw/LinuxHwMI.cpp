@@ -24,13 +24,6 @@ IC::Error ok()
     return IC::Error(0, IC::Number(IC::Number::Generic), std::string());
 }
 
-unsigned char severityOf(unsigned int status)
-{
-    return status == shipped::kStatusCritical  ? shipped::kSeverityCritical
-           : status == shipped::kStatusWarning ? shipped::kSeverityWarning
-                                               : shipped::kSeverityInfo;
-}
-
 unsigned int pollInterval()
 {
     char const* text = std::getenv("IC_LINUXHW_POLL_MS");
@@ -45,12 +38,15 @@ unsigned int pollInterval()
     return static_cast<unsigned int>(*ms);
 }
 
-// Queues one alert on path and logs it.
-void raiseAlert(std::vector<IC::Alert>& out, IC::Alert::ClassType cls, unsigned int status,
-                std::string const& path, std::string const& message)
+void logAlert(IC::Alert const& a)
 {
-    out.emplace_back(severityOf(status), cls, std::vector<std::string>{path}, status, message);
-    LHW_LOG(status == shipped::kStatusNormal ? kProgress : kWarning, "alert: ", message);
+    LHW_LOG(a.getStatus() == shipped::kStatusNormal ? kProgress : kWarning, "alert: ", a.getMessage());
+}
+
+// Properties the plug-in keeps itself rather than take from a scan.
+bool ownProperty(std::string const& name)
+{
+    return name == "state" || name == shipped::kConditionProperty || name == shipped::kConditionClassProperty;
 }
 
 } // namespace
@@ -248,6 +244,7 @@ unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)
 void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce, Outbox& out)
 {
     std::set<std::string> seen;
+    std::size_t leftOut = 0;
     for (Device const& d : found) {
         if (!seen.insert(d.key).second)
             continue; // two entries of one identity: the first one counts
@@ -268,7 +265,7 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
         }
         bool const isNew = it == tracked_.end();
         if (isNew && nextNumber_ > kMaxNumber) {
-            LHW_LOG(kError, d.description, " left out: all node ids are used");
+            ++leftOut;
             continue;
         }
         Tracked& t = tracked_[d.key];
@@ -287,15 +284,71 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
         t.device = d;
         t.present = true;
         t.changing = changing;
-        t.raised = shipped::kStatusNormal;
-        t.linkLost = false;
+        judgeAtStart(t, d);
+        show(t);
         if (announce) {
             out.arrivals.push_back(t.node);
+            if (t.raised != shipped::kStatusNormal)
+                out.troubled.push_back(t.node);
             LHW_LOG(kProgress, "arrived: ", d.description);
         }
     }
+    // Node ids carry 16 bits of our own: said once a scan, not once a device.
+    if (leftOut > 0)
+        LHW_LOG(kError, leftOut, " devices left out: all ", kMaxNumber, " node ids of the plug-in are used");
     if (changing)
         removeMissing(seen, out);
+}
+
+void LinuxHwMI::judgeAtStart(Tracked& t, Device const& d)
+{
+    t.raised = shipped::kStatusNormal;
+    t.raisedMessage.clear();
+    if (d.watch == Watch::Condition && d.status != kStatusUnknown && d.status != shipped::kStatusNormal) {
+        t.raised = d.status;
+        t.raisedClass = shipped::kThreshold;
+        t.raisedMessage = d.message;
+    } else if (d.watch == Watch::MemoryErrors && (d.uncorrected > 0 || d.corrected > 0)) {
+        bool const ue = d.uncorrected > 0;
+        t.raised = ue ? shipped::kStatusCritical : shipped::kStatusWarning;
+        t.raisedClass = shipped::kMemoryErrors;
+        t.raisedMessage = d.description + ": " + std::to_string(ue ? d.uncorrected : d.corrected) +
+                          (ue ? " uncorrected" : " corrected") + " memory errors counted";
+    }
+}
+
+void LinuxHwMI::raiseCondition(Tracked& t, IC::Alert::ClassType cls, unsigned int status,
+                               std::string const& path, std::string const& message, Outbox& out)
+{
+    t.raised = status;
+    t.raisedClass = cls;
+    t.raisedMessage = message;
+    out.alerts.emplace_back(shipped::severityOf(status), cls, std::vector<std::string>{path}, status, message);
+    logAlert(out.alerts.back());
+}
+
+void LinuxHwMI::show(Tracked const& t)
+{
+    HwNode* const node = t.node;
+    Device const& d = t.device;
+    if (d.watch == Watch::None)
+        return;
+    char const* state = t.raised == shipped::kStatusCritical  ? "critical"
+                        : t.raised == shipped::kStatusWarning ? "warning"
+                        : d.watch == Watch::Link && !d.linkUp ? "no link"
+                                                              : "ok";
+    if (d.watch == Watch::Condition && d.status == kStatusUnknown)
+        state = "unknown"; // the condition last reported stands
+    IC::Node::Property p;
+    if (!node->getProperty("state", &p) || p.value != state)
+        node->setProperty("state", state);
+    if (t.raised == shipped::kStatusNormal) {
+        node->removeProperty(shipped::kConditionProperty);
+        node->removeProperty(shipped::kConditionClassProperty);
+    } else if (!node->getProperty(shipped::kConditionProperty, &p) || p.value != t.raisedMessage) {
+        node->setProperty(shipped::kConditionProperty, t.raisedMessage);
+        node->setProperty(shipped::kConditionClassProperty, std::to_string(t.raisedClass));
+    }
 }
 
 void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
@@ -310,7 +363,8 @@ void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
             node->setProperty(p.name, p.value, p.unit);
     }
     for (IC::Node::Property const& q : now) {
-        bool const kept = std::any_of(d.properties.begin(), d.properties.end(),
+        bool const kept = ownProperty(q.name) ||
+                          std::any_of(d.properties.begin(), d.properties.end(),
                                       [&q](IC::Node::Property const& p) { return p.name == q.name; });
         if (!kept)
             node->removeProperty(q.name);
@@ -320,7 +374,7 @@ void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
     t.device = d;
     std::string const path = node->knownPath();
     auto raise = [&](IC::Alert::ClassType cls, unsigned int status, std::string const& message) {
-        raiseAlert(out.alerts, cls, status, path, message);
+        raiseCondition(t, cls, status, path, message, out);
     };
 
     switch (d.watch) {
@@ -330,7 +384,6 @@ void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
         if (d.status == kStatusUnknown || d.status == t.raised || path.empty())
             break;
         raise(shipped::kThreshold, d.status, d.message);
-        t.raised = d.status;
         break;
     case Watch::Link:
         if (!d.linkKnown) {
@@ -340,13 +393,10 @@ void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
         }
         if (path.empty())
             break;
-        if (!d.linkUp && !t.linkLost && before.linkKnown && before.linkUp) {
+        if (!d.linkUp && t.raised == shipped::kStatusNormal && before.linkKnown && before.linkUp)
             raise(shipped::kLink, shipped::kStatusWarning, d.description + " lost its link");
-            t.linkLost = true;
-        } else if (d.linkUp && t.linkLost) {
+        else if (d.linkUp && t.raised != shipped::kStatusNormal)
             raise(shipped::kLink, shipped::kStatusNormal, d.description + " has its link back");
-            t.linkLost = false;
-        }
         break;
     case Watch::MemoryErrors: {
         // An unreadable counter keeps its last value for the comparison.
@@ -356,25 +406,30 @@ void LinuxHwMI::update(Tracked& t, Device const& d, Outbox& out)
             t.device.uncorrected = before.uncorrected;
         if (path.empty())
             break;
+        long long const ceAll = t.device.corrected;
+        long long const ueAll = t.device.uncorrected;
         auto growth = [](long long now, long long was) { return now >= 0 && was >= 0 && now > was ? now - was : 0; };
-        long long const ce = growth(d.corrected, before.corrected);
-        long long const ue = growth(d.uncorrected, before.uncorrected);
-        if (ue > 0) {
-            raise(shipped::kMemoryErrors, shipped::kStatusCritical,
+        long long const ce = growth(ceAll, before.corrected);
+        long long const ue = growth(ueAll, before.uncorrected);
+        // The level is that of all the errors counted, so that a DIMM with
+        // uncorrected errors stays critical when corrected ones come.
+        unsigned int const level = ueAll > 0 ? shipped::kStatusCritical
+                                   : ceAll > 0 ? shipped::kStatusWarning
+                                               : shipped::kStatusNormal;
+        if (ue > 0)
+            raise(shipped::kMemoryErrors, level,
                   d.description + ": " + std::to_string(ue) + " new uncorrected memory errors (" +
-                      std::to_string(d.uncorrected) + " in all)");
-        } else if (ce > 0) {
-            raise(shipped::kMemoryErrors, shipped::kStatusWarning,
+                      std::to_string(ueAll) + " in all)");
+        else if (ce > 0)
+            raise(shipped::kMemoryErrors, level,
                   d.description + ": " + std::to_string(ce) + " new corrected memory errors (" +
-                      std::to_string(d.corrected) + " in all)");
-        } else if (d.corrected == 0 && d.uncorrected == 0 &&
-                   (before.corrected > 0 || before.uncorrected > 0)) {
-            raise(shipped::kMemoryErrors, shipped::kStatusNormal,
-                  d.description + ": error counters were reset");
-        }
+                      std::to_string(ceAll) + " in all)");
+        else if (level != t.raised && ceAll >= 0 && ueAll >= 0)
+            raise(shipped::kMemoryErrors, level, d.description + ": error counters were reset");
         break;
     }
     }
+    show(t);
 }
 
 void LinuxHwMI::removeMissing(std::set<std::string> const& seen, Outbox& out)
@@ -427,6 +482,10 @@ void LinuxHwMI::deliver(Outbox& out)
             LHW_LOG(kWarning, "the library did not take ", node->getDescription(), ": ",
                     e.getText(), " (status ", static_cast<unsigned int>(e.getStatus()), ")");
     }
+    // What was wrong with a device that arrived is told once it has a path.
+    for (HwNode* node : out.troubled)
+        if (shipped::conditionOf(*node, out.alerts))
+            logAlert(out.alerts.back());
     if (!out.alerts.empty() && alertCB_)
         alertCB_(out.alerts, alertContext_);
 }

@@ -18,8 +18,7 @@
 //   5 threshold      a reading beyond a limit, an hwmon alarm or fault file
 //                    set, a supply without input power or reporting bad health:
 //                    status 2 (severity warning) or 3 (critical); status 1
-//                    (information) when it is back to normal. A condition
-//                    present at start is reported by the first poll.
+//                    (information) when it is back to normal.
 //   6 memory-errors  a DIMM's EDAC counts grew: status 2 (warning) for
 //                    corrected errors, 3 (critical) for uncorrected ones;
 //                    status 1 when the counters were reset to zero.
@@ -29,6 +28,10 @@
 //   4 node-removal   a device disappeared: one alert (severity warning,
 //                    status 1) per removed device carrying its path and the
 //                    paths of its removed children.
+//   A condition present at start raises nothing: no functional plug-in is
+//   loaded yet to hear it. It is on the node instead (state, condition,
+//   condition_class; see shipped/common/ShippedAlerts.h), where the health
+//   plug-in finds and asserts it when it starts.
 //   A device that appears is handed to the library's arrival callback, which
 //   raises the class-3 alert itself. When the interface is released, one
 //   removal (severity information, status 1) names every node it reported,
@@ -86,8 +89,11 @@ private:
         std::string claimParent;
         bool present = false;
         bool changing = false;  // read again by every poll, so it may go away
-        unsigned int raised = 1; // Watch::Condition: the status last reported
-        bool linkLost = false;   // Watch::Link: a loss is reported and not cleared
+        // The condition asserted on the node (status 1: none), as its alert
+        // said it; the node shows it in its state and condition properties.
+        unsigned int raised = 1;
+        IC::Alert::ClassType raisedClass = IC::Alert::NodeArrival;
+        std::string raisedMessage;
     };
 
     // What a pass has to tell the library, sent after the lock is released.
@@ -95,11 +101,20 @@ private:
         std::vector<IC::Alert> removals;
         std::vector<HwNode*> arrivals;
         std::vector<IC::Alert> alerts;
+        std::vector<HwNode*> troubled; // arrivals with a condition, raised once they have paths
     };
 
     DeviceList scanChanging();
     void reconcile(DeviceList const& found, bool changing, bool announce, Outbox& out);
     void update(Tracked& t, Device const& d, Outbox& out);
+    // The condition a device has when it is first seen: what is wrong then
+    // is asserted from the start, without an alert of its own.
+    static void judgeAtStart(Tracked& t, Device const& d);
+    // Sets t's condition and queues the alert that reports the change.
+    static void raiseCondition(Tracked& t, IC::Alert::ClassType cls, unsigned int status,
+                               std::string const& path, std::string const& message, Outbox& out);
+    // The node's state, condition and condition_class from t.
+    static void show(Tracked const& t);
     void removeMissing(std::set<std::string> const& seen, Outbox& out);
     unsigned int claimInstance(Tracked& t, Device const& d);
     void deliver(Outbox& out);

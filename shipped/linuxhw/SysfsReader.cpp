@@ -3,6 +3,7 @@
 #include "Log.h"
 
 #include <algorithm>
+#include <charconv>
 #include <cerrno>
 #include <cstdlib>
 #include <cstdint>
@@ -120,6 +121,16 @@ std::optional<long long> SysfsReader::integer(std::string const& rel)
     return v;
 }
 
+std::optional<long long> SysfsReader::count(std::string const& rel)
+{
+    std::optional<long long> const v = integer(rel);
+    if (v && *v < 0) {
+        complain(rel, "negative: " + std::to_string(*v));
+        return std::nullopt;
+    }
+    return v;
+}
+
 std::optional<long long> SysfsReader::quietInteger(std::string const& rel)
 {
     std::optional<std::string> const t = quietText(rel);
@@ -218,12 +229,12 @@ std::string trim(std::string const& s)
 
 std::optional<long long> parseInteger(std::string const& s)
 {
-    if (s.empty())
-        return std::nullopt;
-    char* end = nullptr;
-    errno = 0;
-    long long const v = std::strtoll(s.c_str(), &end, 10);
-    if (errno != 0 || end == s.c_str() || *end != '\0' || s[0] == ' ')
+    // The whole text or nothing: "4\0" "5000" is not 4, "1e3" not 1, and
+    // what does not fit in 64 bits is no number.
+    long long v = 0;
+    char const* const end = s.data() + s.size();
+    auto const r = std::from_chars(s.data(), end, v);
+    if (s.empty() || r.ec != std::errc() || r.ptr != end)
         return std::nullopt;
     return v;
 }

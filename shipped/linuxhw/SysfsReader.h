@@ -29,6 +29,9 @@ public:
     std::optional<std::string> text(std::string const& rel);
     // A decimal integer.
     std::optional<long long> integer(std::string const& rel);
+    // One that cannot be negative (a size, a count, a speed); a negative
+    // value is as bad as garbage.
+    std::optional<long long> count(std::string const& rel);
     // The same without any log line, for attributes the kernel refuses to
     // read in ordinary states (the speed of a port without link).
     std::optional<std::string> quietText(std::string const& rel);
@@ -60,7 +63,8 @@ private:
 
 // Whitespace off both ends.
 std::string trim(std::string const& s);
-// A whole decimal integer ("42", "-1"); nothing for anything else.
+// A whole decimal integer that fits in 64 bits ("42", "-1"); nothing for
+// anything else (signs other than '-', spaces, exponents, embedded NULs).
 std::optional<long long> parseInteger(std::string const& s);
 // The number after prefix in name ("cpu12", "cpu" -> 12); nothing when the
 // rest is not all digits.

@@ -38,7 +38,7 @@ std::map<unsigned int, CpuInfo> parseCpuInfo(std::string const& text)
         std::string const value = trim(line.substr(colon + 1));
         if (key == "processor") {
             std::optional<long long> const n = parseInteger(value);
-            current = n && *n >= 0 ? std::optional<unsigned int>(static_cast<unsigned int>(*n))
+            current = n && *n >= 0 && *n <= 0xFFFFFFF ? std::optional<unsigned int>(static_cast<unsigned int>(*n))
                                    : std::nullopt;
             continue;
         }
@@ -248,6 +248,7 @@ void SystemScanner::scanMemory(DeviceList& out)
             std::optional<long long> const kb = parseInteger(number);
             if (!kb || *kb <= 0 || unit != "kB") {
                 reader_.complain("proc/meminfo", "odd MemTotal line '" + line + "'");
+                mem.set("size", "unknown");
                 break;
             }
             long long const mb = *kb / 1024;
@@ -276,7 +277,7 @@ void SystemScanner::scanDimms(DeviceList& out)
             if (!slot || *slot > 0xFF)
                 continue;
             std::string const dir = mcDir + "/" + name + "/";
-            std::optional<long long> const size = reader_.integer(dir + "size");
+            std::optional<long long> const size = reader_.count(dir + "size");
             if (size && *size == 0)
                 continue; // an empty slot
             Device d;
@@ -292,16 +293,14 @@ void SystemScanner::scanDimms(DeviceList& out)
             d.set("label", *label);
             if (std::optional<std::string> const loc = reader_.text(dir + "dimm_location"))
                 d.set("location", *loc);
-            if (size)
-                d.set("size", std::to_string(*size), "MB");
+            d.set("size", size ? std::to_string(*size) : "unknown", size ? "MB" : "");
             if (std::optional<std::string> const type = reader_.text(dir + "dimm_mem_type"))
                 d.set("type", *type);
-            d.corrected = reader_.integer(dir + "dimm_ce_count").value_or(-1);
-            d.uncorrected = reader_.integer(dir + "dimm_ue_count").value_or(-1);
+            d.corrected = reader_.count(dir + "dimm_ce_count").value_or(-1);
+            d.uncorrected = reader_.count(dir + "dimm_ue_count").value_or(-1);
             auto count = [](long long v) { return v < 0 ? std::string("unknown") : std::to_string(v); };
             d.set("corrected_errors", count(d.corrected));
             d.set("uncorrected_errors", count(d.uncorrected));
-            d.set("state", d.uncorrected > 0 ? "critical" : d.corrected > 0 ? "warning" : "ok");
             out.push_back(d);
         }
     }
