@@ -374,3 +374,24 @@ TEST_F(Icctl, HelpSensorsAndTheVerboseLog)
 }
 
 } // namespace
+
+#ifdef LINUXHW_PLUGIN
+TEST_F(Icctl, AlertsListsWhatIsWrongAtStartWithoutWaiting)
+{
+    fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
+    std::string const examples = std::string(IC_SOURCE_DIR) + "/examples/sysfs/";
+    EXPECT_EQ(out(icctl({"--sysfs-root", examples + "small", "alerts"})), "No asserted alerts.\n");
+    std::pair<char const*, std::vector<std::string>> const trees[] = {
+        {"large", {"health-rollup/warning", "memory-errors/warning"}},
+        {"degraded", {"health-rollup/critical", "memory-errors/critical", "memory-errors/warning",
+                      "threshold/critical", "threshold/critical", "threshold/critical", "threshold/warning"}}};
+    for (auto const& [tree, expected] : trees) {
+        std::vector<std::string> got;
+        json const doc = json::parse(out(icctl({"--sysfs-root", examples + tree, "alerts", "--json"})));
+        for (json const& a : doc.at("alerts"))
+            got.push_back(a.at("className").get<std::string>() + "/" + a.at("statusName").get<std::string>());
+        std::sort(got.begin(), got.end());
+        EXPECT_EQ(got, expected) << tree;
+    }
+}
+#endif
