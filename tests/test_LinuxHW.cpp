@@ -404,6 +404,75 @@ TEST_F(LinuxHwTest, OddFilesAreSkippedWithOneLogLine)
     EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
 }
 
+TEST_F(LinuxHwTest, HostileNumbersAreUnknownAndNeverCrash)
+{
+    using namespace std::string_literals;
+    useTree("small");
+    std::string const chip = "sys/class/hwmon/hwmon9/", mc = "sys/devices/system/edac/mc/mc0/dimm";
+    struct Row {
+        std::string file, value, node, property, expected;
+    } const rows[] = {
+        // Sizes in sectors: the product with 512, the rounding to GB, 64-bit limits, forms that are no number.
+        {"sys/block/h0/size", "99999999999999999", "Disk h0", "size", "unknown"},
+        {"sys/block/h1/size", "18014398509481983", "Disk h1 (9223372037 GB)", "size", "9223372036854775296 bytes"},
+        {"sys/block/h2/size", "9223372036854775807", "Disk h2", "size", "unknown"},
+        {"sys/block/h3/size", "9223372036854775808", "Disk h3", "size", "unknown"},
+        {"sys/block/h4/size", "18446744073709551616", "Disk h4", "size", "unknown"},
+        {"sys/block/h5/size", "-1", "Disk h5", "size", "unknown"},
+        {"sys/block/h6/size", "+512", "Disk h6", "size", "unknown"},
+        {"sys/block/h7/size", "1e9", "Disk h7", "size", "unknown"},
+        {"sys/block/h8/size", "0x200", "Disk h8", "size", "unknown"},
+        {"sys/block/h9/size", "", "Disk h9", "size", "unknown"},
+        {"sys/block/h10/size", "4\0"s "096", "Disk h10", "size", "unknown"},
+        // Readings: negative where the quantity can be, never for a fan.
+        {chip + "temp1_input", "4\0"s "5000", "hostile temp1 temperature", "reading", "unknown"},
+        {chip + "temp1_max", "80000", "hostile temp1 temperature", "state", "unknown"},
+        {chip + "temp2_input", "45000\0"s, "hostile temp2 temperature", "reading", "unknown"},
+        {chip + "temp3_input", "-5000", "hostile temp3 temperature", "reading", "-5.0 C"},
+        {chip + "temp4_input", "-9223372036854775808", "hostile temp4 temperature", "reading", "-9223372036854775.8 C"},
+        {chip + "temp5_input", "9223372036854775807", "hostile temp5 temperature", "reading", "9223372036854775.8 C"},
+        {chip + "temp6_input", "-9223372036854775809", "hostile temp6 temperature", "reading", "unknown"},
+        {chip + "temp7_input", "4.5e4", "hostile temp7 temperature", "reading", "unknown"},
+        {chip + "temp8_input", "50000", "hostile temp8 temperature", "upper_warning", "<none>"},
+        {chip + "temp8_max", "99999999999999999999", "hostile temp8 temperature", "state", "ok"},
+        {chip + "temp9_input", "50000", "hostile temp9 temperature", "state", "ok"},
+        {chip + "temp9_crit_alarm", "-1", "hostile temp9 temperature", "reading", "50.0 C"},
+        {chip + "fan1_input", "-1", "hostile fan1 speed", "reading", "unknown"},
+        {chip + "fan2_input", "18446744073709551615", "hostile fan2 speed", "reading", "unknown"},
+        {chip + "in1_input", "-12000", "hostile in1 voltage", "reading", "-12.000 V"},
+        // Counts and sizes of DIMMs, of memory; a supply's percentage; a port's speed.
+        {mc + "0/size", "-1", "DIMM h0", "size", "unknown"},
+        {mc + "1/dimm_ce_count", "-3", "DIMM h1", "corrected_errors", "unknown"},
+        {mc + "2/dimm_ce_count", "18446744073709551616", "DIMM h2", "corrected_errors", "unknown"},
+        {mc + "3/dimm_ue_count", "1\0"s "1", "DIMM h3", "uncorrected_errors", "unknown"},
+        {mc + "3/size", "4294967296", "DIMM h3", "size", "4294967296 MB"},
+        {"proc/meminfo", "MemTotal: 99999999999999999999 kB", "System memory", "size", "unknown"},
+        {"sys/class/power_supply/BAT0/capacity", "101", "Power supply BAT0", "capacity", "unknown"},
+        {"sys/class/power_supply/BAT1/capacity", "-9223372036854775808", "Power supply BAT1", "capacity", "unknown"},
+        {"sys/class/net/h0/speed", "99999999999999999999", "Network port h0", "speed", "unknown"},
+    };
+    fs::create_directories(root() + "/" + chip);
+    std::ofstream(root() + "/" + chip + "name") << "hostile\n";
+    for (Row const& r : rows) {
+        fs::path const file = root() + "/" + r.file;
+        fs::create_directories(file.parent_path());
+        std::ofstream(file, std::ios::binary) << r.value << '\n';
+        if (r.file.rfind("sys/block/", 0) == 0 || r.file.rfind("sys/class/net/", 0) == 0)
+            fs::create_directories(file.parent_path() / "device");
+        if (r.file.rfind(mc, 0) == 0) {
+            std::ofstream(file.parent_path() / "dimm_label") << "h" << r.file[mc.size()] << '\n';
+            if (!fs::exists(file.parent_path() / "size"))
+                std::ofstream(file.parent_path() / "size") << "16384\n";
+        }
+    }
+    open();
+    for (Row const& r : rows)
+        EXPECT_EQ(prop(r.node, r.property), r.expected) << r.file << " = '" << r.value << "'";
+    // A poll reads them all again.
+    write(chip + "temp3_input", "-6000");
+    EXPECT_TRUE(eventually([&] { return prop("hostile temp3 temperature", "reading") == "-6.0 C"; }));
+}
+
 TEST_F(LinuxHwTest, MissingRootAndOddIntervalStillLoad)
 {
     ictest::LogCapture log;
