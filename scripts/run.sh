@@ -5,6 +5,8 @@
 #
 #   scripts/run.sh                 this machine
 #   scripts/run.sh --example large the large example server (examples/sysfs/large)
+#   scripts/run.sh --example hostile a tree of hostile numbers and names, written
+#                                  by examples/sysfs/make-hostile.sh
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -26,7 +28,10 @@ cmake --build build/release -j "$(nproc 2>/dev/null || echo 2)"
 cmake --install build/release >/dev/null
 
 icctl=("$prefix/bin/icctl")
-if [[ -n "$example" ]]; then
+if [[ "$example" == hostile ]]; then
+  examples/sysfs/make-hostile.sh build/examples/hostile >/dev/null
+  icctl+=(--sysfs-root build/examples/hostile)
+elif [[ -n "$example" ]]; then
   icctl+=(--sysfs-root "examples/sysfs/$example")
 fi
 
