@@ -125,7 +125,9 @@ protected:
         fs::create_directories(dir_->path("fp"));
         fs::create_symlink(LINUXHW_PLUGIN, dir_->path("mi/linuxhw.so"));
         fs::create_symlink(HEALTH_PLUGIN, dir_->path("fp/health.so"));
-        fs::copy(IC_SOURCE_DIR "/examples/sysfs/large", dir_->path("root"), fs::copy_options::recursive);
+        fs::copy(IC_SOURCE_DIR "/examples/sysfs/large", dir_->path("root"),
+                 fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+        std::ofstream(dir_->path("root/proc/sys/kernel/hostname")) << "rack\"7\x1b\n"; // hostile
         setenv("IC_LINUXHW_POLL_MS", "20", 1);
         unsetenv("HGLOG_CONFIG");
         icd_ = new Icd(args({"--listen", "127.0.0.1:0", "--keep-alive", "0.2", "--max-subscribers", "4"}));
@@ -177,7 +179,9 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
           "ic_sensor_value{path=\"" + kTemp + "\",type=\"22\",type_name=\"Temperature Sensor\",instance=\"1\","
           "description=\"CPU 0 Package id 0 temperature\",unit=\"celsius\"} ",
           "ic_sensor_threshold{path=\"" + kTemp + "\",", "kind=\"upper_critical\"} 100\n",
-          "ic_node_state{path=\"" + kTemp + "\",", "ic_node_info{path=\"1f201f5c\",", "vendor=\"Acme Computers\"",
+          "ic_node_state{path=\"" + kTemp + "\",", "ic_node_info{path=\"1f201f5c\",",
+          "ic_node_info{path=\"1f5c\",type=\"59\",type_name=\"ROOT\",instance=\"0\","
+          "description=\"Linux host rack\\\"7\\\\x1b\",parent=\"\"} 1\n", "vendor=\"Acme Computers\"",
           "ic_plugins_loaded{kind=\"mi\"} 1\n", "ic_plugins_loaded{kind=\"fp\"} 1\n",
           "ic_plugin_load_failures_total 0\n", "ic_alerts_asserted{severity=\"critical\"} ",
           "ic_health_status ", "ic_alerts_received_total{class=\"threshold\"} ", "ic_build_info{version=\"",
