@@ -7,7 +7,7 @@
 #include <nlohmann/json.hpp>
 
 #include <crypt.h>
-#include <poll.h>
+#include <fcntl.h>
 #include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
@@ -22,58 +22,49 @@ namespace {
 
 std::string const kTemp = "2f2b01f501f201f5c0"; // CPU 0 package temperature, hwmon0 temp1
 
-// One icd process; stopped with SIGTERM when it goes.
+// One icd process, its output in a file; stopped with SIGTERM when it goes.
 class Icd {
 public:
-    explicit Icd(std::vector<std::string> args)
+    Icd(std::vector<std::string> args, std::string const& log) : log_(log)
     {
         args.insert(args.begin(), ICD_BINARY);
         std::vector<char*> argv;
         for (std::string& a : args)
             argv.push_back(a.data());
         argv.push_back(nullptr);
-        int out[2];
-        EXPECT_EQ(pipe(out), 0);
         posix_spawn_file_actions_t fa;
         posix_spawn_file_actions_init(&fa);
-        posix_spawn_file_actions_adddup2(&fa, out[1], 1);
-        posix_spawn_file_actions_adddup2(&fa, out[1], 2);
-        posix_spawn_file_actions_addclose(&fa, out[0]);
+        posix_spawn_file_actions_addopen(&fa, 1, log.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0600);
+        posix_spawn_file_actions_adddup2(&fa, 1, 2);
         EXPECT_EQ(posix_spawn(&pid_, ICD_BINARY, &fa, nullptr, argv.data(), environ), 0);
         posix_spawn_file_actions_destroy(&fa);
-        close(out[1]);
-        fd_ = out[0];
-        // Up to the URL line, or the end of the output when it stops first.
-        for (char buf[4096]; port_ == 0;) {
-            pollfd p{fd_, POLLIN, 0};
-            if (poll(&p, 1, 20000) <= 0)
-                break;
-            ssize_t const n = read(fd_, buf, sizeof buf);
-            if (n <= 0)
-                break;
-            output_.append(buf, static_cast<std::size_t>(n));
-            auto const at = output_.find("listening on http://127.0.0.1:");
-            if (at != std::string::npos && output_.find('\n', at) != std::string::npos)
-                port_ = std::atoi(output_.c_str() + at + 30);
-        }
+        // Until the URL line, or until it ends by itself.
+        ictest::eventually([this] {
+            std::string const text = output();
+            auto const at = text.find("listening on http://127.0.0.1:");
+            if (at != std::string::npos && text.find('\n', at) != std::string::npos)
+                port_ = std::atoi(text.c_str() + at + 30);
+            return port_ != 0 || waitpid(pid_, &status_, WNOHANG) != 0;
+        }, 20000);
     }
     ~Icd() { stop(); }
 
     // The exit status after SIGTERM (or of the process that already ended).
     int stop()
     {
-        if (pid_ > 0) {
+        if (pid_ > 0 && waitpid(pid_, &status_, WNOHANG) == 0) {
             kill(pid_, SIGTERM);
-            int status = 0;
-            waitpid(pid_, &status, 0);
-            status_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-            pid_ = -1;
-            close(fd_);
+            waitpid(pid_, &status_, 0);
         }
-        return status_;
+        pid_ = -1;
+        return WIFEXITED(status_) ? WEXITSTATUS(status_) : 128 + WTERMSIG(status_);
     }
     int port() const { return port_; }
-    std::string const& output() const { return output_; }
+    std::string output() const
+    {
+        std::ifstream in(log_);
+        return std::string(std::istreambuf_iterator<char>(in), {});
+    }
     httplib::Client client() const
     {
         httplib::Client c("127.0.0.1", port_);
@@ -82,11 +73,10 @@ public:
     }
 
 private:
+    std::string log_;
     pid_t pid_ = -1;
-    int fd_ = -1;
     int port_ = 0;
-    int status_ = -1;
-    std::string output_;
+    int status_ = 0;
 };
 
 std::string run(std::string const& cmd)
@@ -130,7 +120,8 @@ protected:
         std::ofstream(dir_->path("root/proc/sys/kernel/hostname")) << "rack\"7\x1b\n"; // hostile
         setenv("IC_LINUXHW_POLL_MS", "20", 1);
         unsetenv("HGLOG_CONFIG");
-        icd_ = new Icd(args({"--listen", "127.0.0.1:0", "--keep-alive", "0.2", "--max-subscribers", "4"}));
+        icd_ = new Icd(args({"--listen", "127.0.0.1:0", "--keep-alive", "0.2", "--max-subscribers", "4"}),
+                       dir_->path("icd.log"));
         ASSERT_NE(icd_->port(), 0) << icd_->output();
     }
     static void TearDownTestSuite()
@@ -308,7 +299,7 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
 
 TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
 {
-    Icd open(args({"--listen", "0.0.0.0:0"}));
+    Icd open(args({"--listen", "0.0.0.0:0"}), dir_->path("open.log"));
     EXPECT_EQ(open.stop(), 2);
     EXPECT_NE(open.output().find("refusing to listen on 0.0.0.0:0 without --web-config"), std::string::npos)
         << open.output();
@@ -319,13 +310,14 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
                                      &data);
     std::string const config = dir_->write("web.yml", "basic_auth_users:\n  prom: " + hash + "\n");
     std::string const bad = dir_->write("bad.yml", "basic_auth_users:\n  prom: plaintext\n");
-    Icd refused(args({"--listen", "127.0.0.1:0", "--web-config", bad}));
+    Icd refused(args({"--listen", "127.0.0.1:0", "--web-config", bad}), dir_->path("refused.log"));
     EXPECT_EQ(refused.stop(), 2);
     EXPECT_NE(refused.output().find("bad.yml:2: the password of 'prom' is not a bcrypt or SHA-crypt hash"),
               std::string::npos)
         << refused.output();
 
-    Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}));
+    Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}),
+                dir_->path("guarded.log"));
     ASSERT_NE(guarded.port(), 0) << guarded.output();
     struct Case {
         std::string user, password;
