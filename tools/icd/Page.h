@@ -96,11 +96,15 @@ function refresh() {
   if (pending) return;
   pending = setTimeout(() => { pending = null; loadTree().catch(() => {}); loadAlerts().catch(() => {}); }, 300);
 }
+// ?events=N stops listening after N events, so that a headless browser
+// waiting for the network to go quiet can take the page as it then is.
+const stopAfter = Number(new URLSearchParams(location.search).get("events")) || 0;
 function listen() {
   const source = new EventSource("api/v1/events");
   source.addEventListener("alert", () => {
     events += 1;
     document.getElementById("status").textContent = events + " events received";
+    if (stopAfter && events >= stopAfter) source.close();
     refresh();
   });
 }
