@@ -125,14 +125,15 @@ int run(int argc, char** argv)
         sigaddset(&signals, s);
     pthread_sigmask(SIG_BLOCK, &signals, nullptr);
 
-    // The ring and the feed outlive the library: a delivery may run until the
-    // unload has stopped the plug-ins.
+    // The ring and the feed outlive the library, on every way out: a
+    // delivery may run until the unload has stopped the plug-ins.
     EventRing ring(kEventRing);
+    std::optional<AlertFeed> feed;
     std::optional<Library> lib;
     lib.emplace(o.global);
     IC::InstrumentationControl& ic = lib->ic();
     Plugins::afterOpen();
-    AlertFeed feed(ic, ring);
+    feed.emplace(ic, ring);
     if (o.reloadSeconds > 0) {
         auto* loader = new IC::LoaderThread(0, o.reloadSeconds, &Plugins::reload);
         {
@@ -143,7 +144,7 @@ int run(int argc, char** argv)
             ICD_LOG(6000, "the loader thread did not start; plug-ins stay as loaded");
     }
 
-    HttpService service(ic, feed, ring, o.service);
+    HttpService service(ic, *feed, ring, o.service);
     std::vector<std::string> urls;
     try {
         urls = service.start();
