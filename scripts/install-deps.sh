@@ -9,6 +9,7 @@ packages=(
   liblog4cxx-dev
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
+  libcpp-httplib-dev libssl-dev libcrypt-dev
 )
 
 missing=()
