@@ -15,6 +15,7 @@ packages=(
   liblog4cxx-dev
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
+  libcpp-httplib-dev libssl-dev libcrypt-dev
   dpkg-dev curl
 )
 optional=(chromium)

@@ -2,6 +2,8 @@
 #include "Commands.h"
 
 #include "Errors.h"
+#include "Escape.h"
+#include "Forest.h"
 #include "Output.h"
 #include "SensorNames.h"
 
@@ -18,79 +20,6 @@
 namespace icctl {
 namespace {
 
-// The hardware tree as the parent links draw it.
-struct Forest {
-    std::vector<IC::Node*> roots;
-    std::map<IC::Node const*, std::vector<IC::Node*>> children;
-};
-
-Forest buildForest(std::vector<IC::Node*> const& nodes)
-{
-    std::map<unsigned int, IC::Node*> byId;
-    std::map<std::string, IC::Node*> byPath;
-    for (IC::Node* n : nodes) {
-        byId.emplace(n->getNodeId(), n);
-        if (!n->getPath().empty())
-            byPath.emplace(n->getPath(), n);
-    }
-    Forest f;
-    for (IC::Node* n : nodes) {
-        IC::Node* parent = nullptr;
-        unsigned int const linked = n->getLinkedId();
-        if (linked != 0 && linked != n->getNodeId()) {
-            auto it = byId.find(linked);
-            if (it != byId.end())
-                parent = it->second;
-        }
-        if (!parent && !n->getLinkedPath().empty()) {
-            auto it = byPath.find(n->getLinkedPath());
-            if (it != byPath.end() && it->second != n)
-                parent = it->second;
-        }
-        if (parent)
-            f.children[parent].push_back(n);
-        else
-            f.roots.push_back(n);
-    }
-    // Siblings by kind, then instance: discovery order means nothing to a
-    // reader.
-    auto byKind = [](IC::Node const* a, IC::Node const* b) {
-        if (a->getSensor() != b->getSensor())
-            return a->getSensor() < b->getSensor();
-        return a->getInstance() < b->getInstance();
-    };
-    std::stable_sort(f.roots.begin(), f.roots.end(), byKind);
-    for (auto& entry : f.children)
-        std::stable_sort(entry.second.begin(), entry.second.end(), byKind);
-    // Nodes caught in a loop of parent links are reachable from no root;
-    // they are shown at the top rather than lost.
-    std::set<IC::Node const*> seen;
-    std::vector<IC::Node const*> stack(f.roots.begin(), f.roots.end());
-    while (!stack.empty()) {
-        IC::Node const* n = stack.back();
-        stack.pop_back();
-        if (!seen.insert(n).second)
-            continue;
-        for (IC::Node* c : f.children[n])
-            stack.push_back(c);
-    }
-    for (IC::Node* n : nodes) {
-        if (seen.count(n) != 0)
-            continue;
-        f.roots.push_back(n);
-        stack.push_back(n);
-        while (!stack.empty()) {
-            IC::Node const* m = stack.back();
-            stack.pop_back();
-            if (!seen.insert(m).second)
-                continue;
-            for (IC::Node* c : f.children[m])
-                stack.push_back(c);
-        }
-    }
-    return f;
-}
-
 std::vector<IC::Node*> allNodes(IC::InstrumentationControl& ic)
 {
     std::vector<IC::Node*> nodes;
@@ -99,28 +28,15 @@ std::vector<IC::Node*> allNodes(IC::InstrumentationControl& ic)
     return nodes;
 }
 
-void printTree(std::ostream& os, IC::InstrumentationControl& ic, Forest& f, IC::Node* n,
+void printTree(std::ostream& os, IC::InstrumentationControl& ic, Forest const& f, IC::Node* n,
                int depth, std::set<IC::Node const*>& done)
 {
     if (!done.insert(n).second)
         return;
     os << std::string(static_cast<std::size_t>(depth) * 2, ' ') << nodeSummary(*n) << "  ["
        << ic.pathToPrintablePath(n->getPath()) << "]\n";
-    for (IC::Node* c : f.children[n])
+    for (IC::Node* c : f.children(n))
         printTree(os, ic, f, c, depth + 1, done);
-}
-
-Json treeJson(IC::InstrumentationControl& ic, Forest& f, IC::Node* n,
-              std::set<IC::Node const*>& done)
-{
-    Json j = nodeJson(ic, *n);
-    Json kids = Json::array();
-    done.insert(n);
-    for (IC::Node* c : f.children[n])
-        if (done.count(c) == 0)
-            kids.push_back(treeJson(ic, f, c, done));
-    j["children"] = kids;
-    return j;
 }
 
 // A printable path from the command line as the library's binary path.
@@ -159,18 +75,15 @@ int runTree(GlobalOptions const& g)
     Library lib(g);
     IC::InstrumentationControl& ic = lib.ic();
     std::vector<IC::Node*> const nodes = allNodes(ic);
-    Forest f = buildForest(nodes);
+    Forest const f(nodes);
     std::set<IC::Node const*> done;
     if (g.json) {
-        Json roots = Json::array();
-        for (IC::Node* r : f.roots)
-            if (done.count(r) == 0)
-                roots.push_back(treeJson(ic, f, r, done));
-        printJson(std::cout, Json{{"count", nodes.size()}, {"nodes", roots}});
+        // Node by node: a very large tree is never one document in memory.
+        f.writeJson(ic, [](std::string const& piece) { std::cout << piece; });
     } else if (nodes.empty()) {
         std::cout << "No nodes: no management interface reported any hardware.\n";
     } else {
-        for (IC::Node* r : f.roots)
+        for (IC::Node* r : f.roots())
             printTree(std::cout, ic, f, r, 0, done);
     }
     return kExitOk;
@@ -217,10 +130,15 @@ int runShow(GlobalOptions const& g, std::string const& printablePath)
         throw Failure("no node at path " + ic.pathToPrintablePath(path));
 
     std::vector<IC::Node*> const nodes = allNodes(ic);
-    Forest f = buildForest(nodes);
-    std::vector<IC::Node*> const& kids = f.children[node];
+    Forest const f(nodes);
+    std::vector<IC::Node*> const& kids = f.children(node);
+    std::vector<IC::Alert> const asserted = assertedAlerts(ic);
+    if (g.json) {
+        printJson(std::cout, showJson(ic, *node, kids, asserted));
+        return kExitOk;
+    }
     std::vector<IC::Alert> mine;
-    for (IC::Alert const& a : assertedAlerts(ic))
+    for (IC::Alert const& a : asserted)
         for (std::string const& p : a.nodePaths())
             if (p == path) {
                 mine.push_back(a);
@@ -228,25 +146,10 @@ int runShow(GlobalOptions const& g, std::string const& printablePath)
             }
     std::string const hierarchy = ic.getNodeHierarchy(node);
 
-    if (g.json) {
-        Json j = nodeJson(ic, *node);
-        j["hierarchy"] = hierarchy;
-        Json children = Json::array();
-        for (IC::Node* c : kids)
-            children.push_back(ic.pathToPrintablePath(c->getPath()));
-        j["children"] = children;
-        Json alerts = Json::array();
-        for (IC::Alert const& a : mine)
-            alerts.push_back(alertJson(ic, a));
-        j["alerts"] = alerts;
-        printJson(std::cout, j);
-        return kExitOk;
-    }
-
     char id[16];
     std::snprintf(id, sizeof id, "0x%08x", node->getNodeId());
     auto field = [](std::string const& name, std::string const& value) {
-        std::cout << std::left << std::setw(13) << name << value << '\n';
+        std::cout << std::left << std::setw(13) << name << escapeText(value) << '\n';
     };
     field("path", ic.pathToPrintablePath(path));
     field("type", sensorName(node->getSensor()) + " (" + std::to_string(node->getSensor()) + ")");
@@ -274,8 +177,8 @@ int runShow(GlobalOptions const& g, std::string const& printablePath)
     else
         std::cout << "properties\n";
     for (IC::Node::Property const& p : props)
-        std::cout << "  " << p.name << " = " << p.value << (p.unit.empty() ? "" : " " + p.unit)
-                  << '\n';
+        std::cout << "  " << escapeText(p.name) << " = " << escapeText(p.value)
+                  << (p.unit.empty() ? "" : " " + escapeText(p.unit)) << '\n';
     return kExitOk;
 }
 
@@ -287,10 +190,7 @@ int runAlerts(GlobalOptions const& g, AlertsOptions const& o)
         std::this_thread::sleep_for(std::chrono::duration<double>(o.waitSeconds));
     std::vector<IC::Alert> const alerts = assertedAlerts(ic);
     if (g.json) {
-        Json list = Json::array();
-        for (IC::Alert const& a : alerts)
-            list.push_back(alertJson(ic, a));
-        printJson(std::cout, Json{{"count", alerts.size()}, {"alerts", list}});
+        printJson(std::cout, alertListJson(ic, alerts));
         return kExitOk;
     }
     if (alerts.empty()) {

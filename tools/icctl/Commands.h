@@ -9,6 +9,9 @@
 
 namespace icctl {
 
+// The pieces icctl shares with icd.
+using namespace ictools;
+
 int runTree(GlobalOptions const& g);
 
 struct NodesOptions {

@@ -12,7 +12,7 @@
 #include <fstream>
 #include <system_error>
 
-namespace icctl {
+namespace ictools {
 namespace {
 
 namespace fs = std::filesystem;
@@ -51,7 +51,7 @@ void setDirectory(std::string const& value, char const* variable)
 
 } // namespace
 
-void configureLogging(int verbose)
+void configureLogging(int verbose, std::string const& ownLogger)
 {
     if (verbose == 0 && env("HGLOG_CONFIG"))
         return;
@@ -60,13 +60,16 @@ void configureLogging(int verbose)
     char const* level = verbose >= 2 ? "ALL" : verbose == 1 ? "INFO" : "ERROR";
     std::string const config = std::string("log4j.rootLogger=") + (verbose ? "WARN" : "ERROR") +
                                ", err\n"
-                               "log4j.logger.Helmgard=" + level + "\n"
+                               "log4j.logger.Helmgard=" + level + "\n" +
+                               (ownLogger.empty() || verbose >= 2
+                                    ? std::string()
+                                    : "log4j.logger." + ownLogger + "=INFO\n") +
                                "log4j.appender.err=org.apache.log4j.ConsoleAppender\n"
                                "log4j.appender.err.Target=System.err\n"
                                "log4j.appender.err.layout=org.apache.log4j.PatternLayout\n"
                                "log4j.appender.err.layout.ConversionPattern="
                                "%d{HH:mm:ss.SSS} %-5p %c: %m%n\n";
-    char name[] = "/tmp/icctl-log-XXXXXX";
+    char name[] = "/tmp/ic-log-XXXXXX";
     int const fd = mkstemp(name);
     if (fd < 0)
         return; // logging stays as it was; nothing else depends on it
@@ -122,4 +125,4 @@ std::string loadCodeText(unsigned int code)
     }
 }
 
-} // namespace icctl
+} // namespace ictools

@@ -7,7 +7,7 @@
 
 #include <string>
 
-namespace icctl {
+namespace ictools {
 
 // "Temperature Sensor"; "type N" for a number outside the table.
 std::string sensorName(unsigned int type);
@@ -28,4 +28,4 @@ std::string severityName(unsigned int severity);
 // "normal", "warning", "critical"; "status N" otherwise.
 std::string statusName(unsigned int status);
 
-} // namespace icctl
+} // namespace ictools

@@ -1,10 +1,10 @@
-// Exit statuses of icctl and the exceptions that lead to them.
+// Exit statuses of icctl and icd and the exceptions that lead to them.
 #pragma once
 
 #include <stdexcept>
 #include <string>
 
-namespace icctl {
+namespace ictools {
 
 enum ExitCode : int {
     kExitOk = 0,
@@ -28,4 +28,4 @@ struct OpenError : std::runtime_error {
     using std::runtime_error::runtime_error;
 };
 
-} // namespace icctl
+} // namespace ictools

@@ -6,7 +6,7 @@
 
 #include <string>
 
-namespace icctl {
+namespace ictools {
 
 struct GlobalOptions {
     std::string miDir;     // --mi-dir, else IC_MI_DIR, else the built-in default
@@ -18,7 +18,8 @@ struct GlobalOptions {
 
 // Quiet by default (errors only), the library's progress with -v, all of it
 // with -vv. A configuration named by HGLOG_CONFIG is kept unless -v is given.
-void configureLogging(int verbose);
+// ownLogger, when given, logs its progress and warnings even when quiet.
+void configureLogging(int verbose, std::string const& ownLogger = std::string());
 
 // The library, opened with the options' directories; unloaded when the
 // object goes. Throws UsageError for a directory that does not exist and
@@ -39,4 +40,4 @@ private:
 // Meaning of a load code returned by the library's open.
 std::string loadCodeText(unsigned int code);
 
-} // namespace icctl
+} // namespace ictools

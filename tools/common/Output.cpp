@@ -1,11 +1,12 @@
 #include "Output.h"
 
+#include "Escape.h"
 #include "SensorNames.h"
 
 #include <algorithm>
 #include <ostream>
 
-namespace icctl {
+namespace ictools {
 namespace {
 
 std::string printable(IC::InstrumentationControl& ic, std::string const& path)
@@ -41,13 +42,13 @@ std::string stateText(IC::Node const& node)
 std::string nodeSummary(IC::Node const& node)
 {
     std::string line = sensorName(node.getSensor()) + " " + std::to_string(node.getInstance()) +
-                       ": " + node.getDescription();
+                       ": " + escapeText(node.getDescription());
     std::string const reading = readingText(node);
     if (!reading.empty())
-        line += " = " + reading;
+        line += " = " + escapeText(reading);
     std::string const state = stateText(node);
     if (!state.empty())
-        line += " (" + state + ")";
+        line += " (" + escapeText(state) + ")";
     return line;
 }
 
@@ -112,16 +113,24 @@ std::string alertLine(IC::InstrumentationControl& ic, IC::Alert const& alert)
         line += " [" + printable(ic, path);
         if (IC::Node* node = lookup(ic, path))
             line += " " + sensorName(node->getSensor()) + " " +
-                    std::to_string(node->getInstance()) + ": " + node->getDescription();
+                    std::to_string(node->getInstance()) + ": " +
+                    escapeText(node->getDescription());
         line += "]";
     }
-    line += " " + alert.getMessage();
+    line += " " + escapeText(alert.getMessage());
     return line;
 }
 
 void printTable(std::ostream& os, std::vector<std::string> const& header,
-                std::vector<std::vector<std::string>> const& rows)
+                std::vector<std::vector<std::string>> const& rawRows)
 {
+    std::vector<std::vector<std::string>> rows;
+    rows.reserve(rawRows.size());
+    for (auto const& raw : rawRows) {
+        rows.emplace_back();
+        for (std::string const& cell : raw)
+            rows.back().push_back(escapeText(cell));
+    }
     std::vector<std::size_t> widths(header.size(), 0);
     auto measure = [&widths](std::vector<std::string> const& row) {
         for (std::size_t i = 0; i < row.size() && i < widths.size(); ++i)
@@ -148,12 +157,44 @@ void printTable(std::ostream& os, std::vector<std::string> const& header,
 
 void printJson(std::ostream& os, Json const& doc)
 {
-    os << doc.dump(2, ' ', false, Json::error_handler_t::replace) << '\n';
+    std::string text = doc.dump(2, ' ', false, Json::error_handler_t::replace);
+    escapeJsonControls(text);
+    os << text << '\n';
 }
 
 std::string jsonLine(Json const& doc)
 {
-    return doc.dump(-1, ' ', false, Json::error_handler_t::replace);
+    std::string text = doc.dump(-1, ' ', false, Json::error_handler_t::replace);
+    escapeJsonControls(text);
+    return text;
 }
 
-} // namespace icctl
+Json alertListJson(IC::InstrumentationControl& ic, std::vector<IC::Alert> const& alerts)
+{
+    Json list = Json::array();
+    for (IC::Alert const& a : alerts)
+        list.push_back(alertJson(ic, a));
+    return Json{{"count", alerts.size()}, {"alerts", list}};
+}
+
+Json showJson(IC::InstrumentationControl& ic, IC::Node& node,
+              std::vector<IC::Node*> const& children, std::vector<IC::Alert> const& asserted)
+{
+    Json j = nodeJson(ic, node);
+    j["hierarchy"] = ic.getNodeHierarchy(&node);
+    Json kids = Json::array();
+    for (IC::Node* c : children)
+        kids.push_back(ic.pathToPrintablePath(c->getPath()));
+    j["children"] = kids;
+    Json alerts = Json::array();
+    for (IC::Alert const& a : asserted)
+        for (std::string const& p : a.nodePaths())
+            if (p == node.getPath()) {
+                alerts.push_back(alertJson(ic, a));
+                break;
+            }
+    j["alerts"] = alerts;
+    return j;
+}
+
+} // namespace ictools

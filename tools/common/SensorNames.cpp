@@ -8,7 +8,7 @@
 #include <cctype>
 #include <cstdlib>
 
-namespace icctl {
+namespace ictools {
 namespace {
 
 constexpr unsigned int kValidTypes = IC::Node::invalid; // 0..73
@@ -108,4 +108,4 @@ std::string statusName(unsigned int status)
     }
 }
 
-} // namespace icctl
+} // namespace ictools
