@@ -16,9 +16,9 @@ packages=(
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
   libcpp-httplib-dev libssl-dev libcrypt-dev
-  dpkg-dev curl
+  dpkg-dev curl jq
 )
-optional=(chromium)
+optional=(chromium chromium-driver)
 
 installed() { dpkg-query -W -f='${Status}' "$1" 2>/dev/null | grep -q 'install ok installed'; }
 missing=()
