@@ -374,3 +374,68 @@ TEST_F(Icctl, HelpSensorsAndTheVerboseLog)
 }
 
 } // namespace
+
+#ifdef LINUXHW_PLUGIN
+// Names written by firmware, drivers and whoever renames an interface reach
+// every output escaped: one node stays one line, the terminal is never
+// driven, and JSON gives the original text back.
+TEST_F(Icctl, HostileNamesAreEscapedInEveryOutput)
+{
+    fs::copy(IC_SOURCE_DIR "/examples/sysfs/large", dir_ / "root",
+             fs::copy_options::recursive | fs::copy_options::copy_symlinks);
+    fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
+    fs::path const cls = dir_ / "root/sys/class";
+    struct Case {
+        fs::path file;           // written with raw, or renamed to raw when rename
+        std::string raw;         // the hostile name
+        bool rename;
+        std::string line, shown; // a line of the tree starts with line and holds shown
+        std::string json;        // the description JSON gives back ("" when not UTF-8)
+    } const cases[] = {
+        {dir_ / "root/proc/sys/kernel/hostname", "rack\x1b[2Jforged", false, "ROOT 0: ",
+         "Linux host rack\\x1b[2Jforged  [1f5c]", "Linux host rack\x1b[2Jforged"},
+        {cls / "dmi/id/product_name", "R720\x1b]0;title\x07", false, "  Chassis 0: ",
+         "System Acme Computers R720\\x1b]0;title\\x07  [1f201f5c]", "System Acme Computers R720\x1b]0;title\x07"},
+        {cls / "hwmon/hwmon0/temp1_label", "Package\x7fid\xc2\x9b" "0", false, "      Temperature Sensor 1: ",
+         "CPU 0 Package\\x7fid\\u009b0 temperature = 52.0 C (ok)", "CPU 0 Package\x7fid\xc2\x9b" "0 temperature"},
+        {cls / "hwmon/hwmon2/name", "nct\xff\xfe" "6779", false, "    Fan ", ": nct\\xff\\xfe6779 fan1 speed = 5400 RPM",
+         ""},
+        {cls / "power_supply/PSU1", "PSU1\nROOT 0: forged line", true, "    Power Supply ",
+         ": Power supply PSU1\\x0aROOT 0: forged line (Mains) = 184.0 W (ok)",
+         "Power supply PSU1\nROOT 0: forged line (Mains)"},
+        {cls / "net/eno1", "eno\x1b[31m1", true, "    Network Port ", ": Network port eno\\x1b[31m1 (b4:96",
+         "Network port eno\x1b[31m1 (b4:96:91:4a:10:01)"},
+    };
+    for (Case const& c : cases) {
+        if (c.rename)
+            fs::rename(c.file, c.file.parent_path() / c.raw);
+        else
+            std::ofstream(c.file, std::ios::binary) << c.raw << "\n";
+    }
+    std::string const root = (dir_ / "root").string();
+    std::string const tree = out(icctl({"--sysfs-root", root, "tree"}));
+    std::string const nodes = out(icctl({"--sysfs-root", root, "nodes"}));
+    std::string const show = out(icctl({"--sysfs-root", root, "show", "2f2b01f501f201f5c0"}));
+    std::string const text = out(icctl({"--sysfs-root", root, "--json", "nodes"}));
+    for (std::string const* output : {&tree, &nodes, &show, &text})
+        for (std::size_t i = 0; i < output->size(); ++i) {
+            auto const b = static_cast<unsigned char>((*output)[i]);
+            ASSERT_TRUE((b >= 0x20 && b != 0x7f) || b == '\n') << "raw control at " << i << ": " << *output;
+            ASSERT_FALSE(b == 0xc2 && static_cast<unsigned char>((*output)[i + 1]) < 0xa0) << *output;
+        }
+    EXPECT_EQ(lines(tree).size(), 76u) << tree; // as many lines as nodes: none forged
+    EXPECT_EQ(lines(nodes).size(), 77u);
+    EXPECT_NE(show.find("\ndescription  CPU 0 Package\\x7fid\\u009b0 temperature\n"), std::string::npos) << show;
+    json const doc = json::parse(text);
+    for (Case const& c : cases) {
+        SCOPED_TRACE(c.shown);
+        auto const all = lines(tree);
+        EXPECT_TRUE(std::any_of(all.begin(), all.end(), [&](std::string const& l) {
+            return l.rfind(c.line, 0) == 0 && l.find(c.shown) != std::string::npos;
+        })) << tree;
+        std::string const wanted = c.json.empty() ? "nct\xef\xbf\xbd\xef\xbf\xbd" "6779 fan1 speed" : c.json;
+        EXPECT_TRUE(std::any_of(doc.at("nodes").begin(), doc.at("nodes").end(),
+                                [&](json const& n) { return n.at("description") == wanted; }));
+    }
+}
+#endif
