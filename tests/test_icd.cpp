@@ -261,7 +261,7 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
         icd_->client().Get("/api/v1/events", [&](char const* data, std::size_t n) {
             std::lock_guard<std::mutex> g(m);
             text.append(data, n);
-            ready = true; // the first keep-alive says the stream is open
+            ready = true; // the first comment says the stream is open
             count = parseEvents(text).size();
             return count < 8 && !quit;
         });

@@ -12,7 +12,7 @@ std::uint64_t EventRing::push(std::string data)
         id = ++lastId_;
         if (events_.size() == capacity_)
             events_.pop_front();
-        events_.push_back(Event{id, std::move(data)});
+        events_.push_back(Event{id, std::make_shared<std::string const>(std::move(data))});
     }
     arrived_.notify_all();
     return id;

@@ -7,6 +7,7 @@
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
+#include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -15,7 +16,7 @@ namespace icd {
 
 struct Event {
     std::uint64_t id;
-    std::string data; // one JSON line
+    std::shared_ptr<std::string const> data; // one JSON line, shared by every reader
 };
 
 class EventRing {

@@ -13,7 +13,10 @@
 
 #include <httplib.h>
 
+#include <sys/socket.h>
+
 #include <cctype>
+#include <functional>
 #include <stdexcept>
 
 namespace icd {
@@ -44,6 +47,16 @@ char const* reason(int status)
     default: return "request refused";
     }
 }
+
+// httplib listens with a backlog of 5: a burst of clients (a hundred event
+// streams reconnecting after a restart) would wait for SYN retries of 1 s
+// and more. Listening again on the bound socket widens the queue.
+template <class Base>
+class Listener : public Base {
+public:
+    using Base::Base;
+    void widenBacklog() { ::listen(this->svr_sock_, SOMAXCONN); }
+};
 
 } // namespace
 
@@ -87,16 +100,23 @@ std::vector<std::string> HttpService::start()
         int port = 0;
         splitListen(listen, &host, &port);
         std::unique_ptr<httplib::Server> server;
-        if (options_.web.tls())
-            server = std::make_unique<httplib::SSLServer>(options_.web.certFile().c_str(),
-                                                          options_.web.keyFile().c_str());
-        else
-            server = std::make_unique<httplib::Server>();
+        std::function<void()> widen;
+        if (options_.web.tls()) {
+            auto tls = std::make_unique<Listener<httplib::SSLServer>>(
+                options_.web.certFile().c_str(), options_.web.keyFile().c_str());
+            widen = [s = tls.get()] { s->widenBacklog(); };
+            server = std::move(tls);
+        } else {
+            auto plain = std::make_unique<Listener<httplib::Server>>();
+            widen = [s = plain.get()] { s->widenBacklog(); };
+            server = std::move(plain);
+        }
         if (!server->is_valid())
             throw std::runtime_error("cannot use the TLS certificate or key of the web configuration");
         std::size_t const workers = options_.maxConnections;
         server->new_task_queue = [workers] { return new WorkerPool(workers, workers); };
         server->set_payload_max_length(kMaxPayload);
+        server->set_tcp_nodelay(true); // a response is one write; waiting for an ACK costs 40 ms
         server->set_keep_alive_max_count(100);
         server->set_keep_alive_timeout(5);
         server->set_read_timeout(5);
@@ -107,6 +127,7 @@ std::vector<std::string> HttpService::start()
         int const bound = port == 0 ? server->bind_to_any_port(host) : port;
         if (bound < 0 || (port != 0 && !server->bind_to_port(host, port)))
             throw std::runtime_error("cannot listen on " + listen);
+        widen();
         std::string const shown = host.find(':') != std::string::npos ? "[" + host + "]" : host;
         urls.push_back((options_.web.tls() ? "https://" : "http://") + shown + ":" +
                        std::to_string(bound) + "/");
@@ -279,7 +300,12 @@ void HttpService::events(httplib::Request const& req, httplib::Response& res)
     auto next = std::make_shared<std::uint64_t>(after);
     res.set_chunked_content_provider(
         "text/event-stream",
-        [this, next](std::size_t, httplib::DataSink& sink) {
+        [this, next](std::size_t offset, httplib::DataSink& sink) {
+            if (offset == 0) {
+                // At once, so that the client knows the stream is open.
+                static char const opened[] = ": connected\nretry: 2000\n\n";
+                return sink.write(opened, sizeof opened - 1);
+            }
             std::vector<Event> events;
             std::uint64_t missed = 0;
             if (!ring_.readAfter(*next, options_.keepAlive, events, &missed)) {
@@ -290,7 +316,7 @@ void HttpService::events(httplib::Request const& req, httplib::Response& res)
             if (missed != 0)
                 out += ": missed " + std::to_string(missed) + " events\n\n";
             for (Event const& e : events)
-                out += "id: " + std::to_string(e.id) + "\nevent: alert\ndata: " + e.data + "\n\n";
+                out += "id: " + std::to_string(e.id) + "\nevent: alert\ndata: " + *e.data + "\n\n";
             if (out.empty())
                 out = ": keep-alive\n\n";
             if (!events.empty())

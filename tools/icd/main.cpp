@@ -15,6 +15,7 @@
 
 #include <CLI/CLI.hpp>
 
+#include <malloc.h>
 #include <signal.h>
 
 #include <iostream>
@@ -112,6 +113,9 @@ int run(int argc, char** argv)
     o.service.keepAlive = std::chrono::milliseconds(static_cast<long>(o.keepAliveSeconds * 1000));
     checkListen(o);
     configureLogging(o.global.verbose, "Helmgard.IC.Icd");
+    // Connection threads would each get an allocator arena of their own and
+    // keep its memory; two arenas serve a daemon that mostly waits.
+    mallopt(M_ARENA_MAX, 2);
 
     // Every thread started from here on (the library's, the plug-ins', the
     // servers') inherits the mask; only the loop below takes these signals.
