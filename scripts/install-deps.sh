@@ -1,7 +1,13 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build and the tests need. Skips apt when
 # everything is already there, except on CI, which always asks apt.
+#
+# The browser and promtool tests of icd skip when chromium or promtool could
+# not be had. promtool is taken out of Debian's prometheus package into
+# build/deps/ rather than installed: installing it would start a Prometheus
+# server.
 set -euo pipefail
+cd "$(dirname "$0")/.."
 
 packages=(
   build-essential cmake pkg-config binutils
@@ -10,17 +16,34 @@ packages=(
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
   libcpp-httplib-dev libssl-dev libcrypt-dev
+  dpkg-dev curl jq
 )
+optional=(chromium chromium-driver)
 
+installed() { dpkg-query -W -f='${Status}' "$1" 2>/dev/null | grep -q 'install ok installed'; }
 missing=()
-for p in "${packages[@]}"; do
-  dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q 'install ok installed' || missing+=("$p")
+for p in "${packages[@]}" "${optional[@]}"; do
+  installed "$p" || missing+=("$p")
 done
+have_promtool() { command -v promtool >/dev/null || [[ -x build/deps/usr/bin/promtool ]]; }
 
-if [[ ${#missing[@]} -gt 0 || "${CI:-}" == "true" ]]; then
+if [[ ${#missing[@]} -gt 0 || "${CI:-}" == "true" ]] || ! have_promtool; then
   sudo=""
   [[ $(id -u) -ne 0 ]] && sudo="sudo"
   export DEBIAN_FRONTEND=noninteractive
   $sudo apt-get update -qq
   $sudo apt-get install -y -qq --no-install-recommends "${packages[@]}"
+  for p in "${optional[@]}"; do
+    installed "$p" || $sudo apt-get install -y -qq --no-install-recommends "$p" \
+      || echo "install-deps: $p did not install; the tests that need it will skip" >&2
+  done
+  if ! have_promtool; then
+    scratch=$(mktemp -d) && chmod 755 "$scratch"
+    if (cd "$scratch" && apt-get download -qq -o APT::Sandbox::User=root prometheus); then
+      mkdir -p build/deps && dpkg -x "$scratch"/prometheus_*.deb build/deps
+    else
+      echo "install-deps: prometheus did not download; the promtool test will skip" >&2
+    fi
+    rm -rf "$scratch"
+  fi
 fi

@@ -1,21 +1,27 @@
 #!/usr/bin/env bash
 # The main job: installs what it needs, builds and installs the library, its
-# plug-ins and icctl into build/install, then shows this machine's hardware
-# with `icctl tree` and a few seconds of `icctl watch`.
+# plug-ins, icctl and icd into build/install, then shows this machine's
+# hardware with `icctl tree` and a few seconds of `icctl watch`, and starts
+# icd for one scrape of its metrics (printing its URL) before stopping it.
 #
 #   scripts/run.sh                 this machine
 #   scripts/run.sh --example large the large example server (examples/sysfs/large)
 #   scripts/run.sh --example hostile a tree of hostile numbers and names, written
 #                                  by examples/sysfs/make-hostile.sh
+#   scripts/run.sh --serve         build and install, then run icd in the
+#                                  foreground (ICD_LISTEN, default
+#                                  127.0.0.1:9847) until Ctrl-C
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 example=""
+serve=0
 watch_seconds=${IC_WATCH_SECONDS:-5}
 while [[ $# -gt 0 ]]; do
   case "$1" in
-    --example) example=${2:?--example needs small or large}; shift 2 ;;
-    *) echo "usage: $0 [--example small|large]" >&2; exit 2 ;;
+    --example) example=${2:?--example needs small, large, degraded or hostile}; shift 2 ;;
+    --serve) serve=1; shift ;;
+    *) echo "usage: $0 [--example small|large|degraded|hostile] [--serve]" >&2; exit 2 ;;
   esac
 done
 
@@ -28,11 +34,20 @@ cmake --build build/release -j "$(nproc 2>/dev/null || echo 2)"
 cmake --install build/release >/dev/null
 
 icctl=("$prefix/bin/icctl")
+icd=("$prefix/bin/icd")
 if [[ "$example" == hostile ]]; then
   examples/sysfs/make-hostile.sh build/examples/hostile >/dev/null
   icctl+=(--sysfs-root build/examples/hostile)
+  icd+=(--sysfs-root build/examples/hostile)
 elif [[ -n "$example" ]]; then
   icctl+=(--sysfs-root "examples/sysfs/$example")
+  icd+=(--sysfs-root "examples/sysfs/$example")
+fi
+
+if [[ $serve -eq 1 ]]; then
+  listen=${ICD_LISTEN:-127.0.0.1:9847}
+  echo "=== icd, until Ctrl-C: the page at /, /metrics, /api/v1/nodes ==="
+  exec "${icd[@]}" --listen "$listen"
 fi
 
 echo "=== icctl tree ==="
@@ -40,3 +55,14 @@ echo "=== icctl tree ==="
 echo
 echo "=== icctl watch (${watch_seconds} s) ==="
 "${icctl[@]}" watch --for "$watch_seconds"
+
+echo
+echo "=== icd: one scrape ==="
+source scripts/icd-lib.sh
+trap icd_stop_quietly EXIT
+icd_start build/icd.log "${icd[@]}"
+curl -fsS --max-time 10 -o build/icd-metrics.txt "$icd_url/metrics"
+echo "icd answered at $icd_url/ (page), $icd_url/metrics, $icd_url/api/v1/nodes"
+grep -v '^#' build/icd-metrics.txt | head -n 8
+echo "... $(grep -vc '^#' build/icd-metrics.txt) samples; scripts/run.sh --serve keeps icd running"
+icd_stop
