@@ -8,7 +8,9 @@
 //
 // Indexes are hash tables; the orders that callers see are kept: getMap
 // lists by ascending sensor type and order of addition, and removing a node
-// drops the smallest of the paths under which it is registered.
+// drops the smallest of the paths under which it is registered. Every
+// per-node operation, removal included, costs the same whatever the size of
+// the store.
 //
 // Path code: each pair is written as its instance in base 12 (letters b..m,
 // most significant first), "p", its sensor type in base 12, "a"; the letter
@@ -19,9 +21,9 @@
 #include <IC/Error.h>
 #include <IC/Export.h>
 #include <IC/Node.h>
-#include <SD/Mutex.h>
-
+#include <cstddef>
 #include <map>
+#include <mutex>
 #include <unordered_map>
 #include <string>
 #include <utility>
@@ -141,15 +143,30 @@ private:
                             std::vector<PendingPath> const& pending);
     Node* registeredNode(unsigned int id) const;
     std::string const* cachedPath(unsigned int id) const;
+    // Enters the node last in the getMap list of its type.
+    void list(Node* node);
+    // Removes the node's first entry from the getMap list of its type.
     void unlist(Node* node);
 
-    // By sensor type (ascending), in order of addition: what getMap lists.
-    std::map<Node::SensorType, std::vector<Node*> > sensorMap;
+    // The nodes of one sensor type in order of addition. A removed node
+    // leaves a hole until holes outnumber nodes; positions finds a node's
+    // places without a search.
+    struct TypeList {
+        std::vector<Node*> nodes;
+        std::unordered_multimap<Node*, std::size_t> positions;
+    };
+
+    // By sensor type (ascending): what getMap lists.
+    std::map<Node::SensorType, TypeList> sensorMap;
     // The id index and the path cache, by node id.
     std::unordered_map<unsigned int, IdEntry> idMap;
     // Node by path; the first node to claim a path keeps it.
     std::unordered_map<std::string, Node*> nodePathMap;
-    mutable SD::Mutex storeLock;
+    // The keys of nodePathMap that lead to each node, so that removing a
+    // node needs no walk of nodePathMap.
+    std::unordered_multimap<Node*, std::string const*> pathsOfNode;
+    // Re-entrant: path computations look nodes up under the lock they hold.
+    mutable std::recursive_mutex storeLock;
 };
 
 } // namespace IC
