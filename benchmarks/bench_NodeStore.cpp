@@ -21,32 +21,44 @@
 namespace {
 
 constexpr std::size_t kNodes = 1000000;
-constexpr unsigned int kFanOut = 16;
 
-// A tree of depth 6 (root and five levels below it), breadth first, so that
-// every parent comes before its children.
-std::vector<std::unique_ptr<IC::Node>> const& tree()
+using Tree = std::vector<std::unique_ptr<IC::Node>>;
+
+// A million nodes, breadth first, so that every parent comes before its
+// children.
+Tree makeTree(unsigned int fanOut)
 {
-    static std::vector<std::unique_ptr<IC::Node>> nodes = [] {
-        static IC::Node::SensorType const types[] = {IC::Node::ROOT, IC::Node::Chassis,
-                                                     IC::Node::CPU,  IC::Node::CPUCore,
-                                                     IC::Node::Cache, IC::Node::PFASensor};
-        std::vector<std::unique_ptr<IC::Node>> v;
-        v.reserve(kNodes);
-        std::vector<unsigned int> depth;
-        depth.reserve(kNodes);
-        v.push_back(std::make_unique<IC::Node>(IC::Node::ROOT, 0, 1, 0, "root"));
-        depth.push_back(0);
-        for (std::size_t parent = 0; v.size() < kNodes; ++parent) {
-            for (unsigned int i = 0; i < kFanOut && v.size() < kNodes; ++i) {
-                unsigned int const d = depth[parent] + 1;
-                auto const id = static_cast<unsigned int>(v.size() + 1);
-                v.push_back(std::make_unique<IC::Node>(types[d], i, id, v[parent]->getNodeId(), ""));
-                depth.push_back(d);
-            }
+    static IC::Node::SensorType const types[] = {IC::Node::ROOT,  IC::Node::Chassis,
+                                                 IC::Node::CPU,   IC::Node::CPUCore,
+                                                 IC::Node::Cache, IC::Node::PFASensor};
+    Tree v;
+    v.reserve(kNodes);
+    std::vector<unsigned int> depth;
+    depth.reserve(kNodes);
+    v.push_back(std::make_unique<IC::Node>(IC::Node::ROOT, 0, 1, 0, "root"));
+    depth.push_back(0);
+    for (std::size_t parent = 0; v.size() < kNodes; ++parent) {
+        for (unsigned int i = 0; i < fanOut && v.size() < kNodes; ++i) {
+            unsigned int const d = depth[parent] + 1;
+            auto const id = static_cast<unsigned int>(v.size() + 1);
+            v.push_back(std::make_unique<IC::Node>(types[d], i, id, v[parent]->getNodeId(), ""));
+            depth.push_back(d);
         }
-        return v;
-    }();
+    }
+    return v;
+}
+
+// Depth 6 (fan-out 16): the adds and the memory.
+Tree const& tree()
+{
+    static Tree const nodes = makeTree(16);
+    return nodes;
+}
+
+// Depth 4 (fan-out 100), paths of 10 and 11 bytes: the look-ups.
+Tree const& wideTree()
+{
+    static Tree const nodes = makeTree(100);
     return nodes;
 }
 
@@ -62,7 +74,7 @@ IC::NodeStore& filledStore()
     static IC::NodeStore* store = [] {
         auto* s = new IC::NodeStore;
         bool isNew = false;
-        for (auto const& n : tree()) {
+        for (auto const& n : wideTree()) {
             IC::Node* const node = n.get();
             s->addNodeIfNew(node, isNew);
         }
@@ -99,7 +111,7 @@ constexpr std::size_t kProbes = 1 << 16;
 std::vector<std::string> const& probePaths()
 {
     static std::vector<std::string> const paths = [] {
-        auto const& nodes = tree();
+        auto const& nodes = wideTree();
         filledStore(); // the nodes learn their paths there
         std::vector<std::string> v;
         std::mt19937 rng(7);
@@ -154,7 +166,7 @@ void bareLookups(benchmark::State& state, std::vector<Key> const& keys, KeyOf ke
 {
     static BareMap<Key> const& bare = *[keyOf] {
         auto* b = new BareMap<Key>;
-        for (auto const& n : tree())
+        for (auto const& n : wideTree())
             b->map.emplace(keyOf(*n), n.get());
         return b;
     }();

@@ -289,8 +289,14 @@ void NodeStore::clear()
 
 Error NodeStore::getNode(unsigned int id, Node** node) const
 {
+    // Looked up here rather than through nodeId2Node: an exported member is
+    // called through the procedure linkage table, which this path avoids.
     Guard guard(storeLock);
-    return nodeId2Node(id, node);
+    auto it = idMap.find(id);
+    if (it == idMap.end() || !it->second.node)
+        return notFound();
+    *node = it->second.node;
+    return found();
 }
 
 Error NodeStore::getNode(std::string path, Node** node) const
