@@ -438,7 +438,8 @@ AlertCall deliveryFromHits(AlertRegister const& reg, std::vector<Alert> const& a
             for (Hit const* h = first; h != end; ++h)
                 matched.push_back(alert.nodePaths()[h->path]);
         }
-        call.addRestricted(alert, std::move(matched));
+        if (!matched.empty()) // a class match of an alert without paths
+            call.addRestricted(alert, std::move(matched));
         first = end;
     }
     return call;

@@ -360,4 +360,8 @@ TEST_F(Dispatch, ARemovalNamingManyPathsDropsExactlyThoseAndRegistersStillMatchT
         expectError(ICC::AlertCallBackFP({alert(0, c.paths)}), 0);
         EXPECT_EQ(gDeliveries, c.expected) << c.paths.size();
     }
+    ICC::registerForAlerts(recA, cls(7), &c2);
+    gDeliveries.clear();
+    ICC::AlertCallBackFP({alert(7, {})});
+    EXPECT_EQ(gDeliveries, (Deliveries{{2, ""}})) << "a class match of no path: an empty call";
 }
