@@ -22,6 +22,7 @@
 #include <IC/Export.h>
 #include <IC/Node.h>
 #include <cstddef>
+#include <cstdint>
 #include <map>
 #include <mutex>
 #include <unordered_map>
@@ -156,12 +157,27 @@ private:
         std::unordered_multimap<Node*, std::size_t> positions;
     };
 
+    // Hashes a path a byte at a time. A look-up's path is a copy its caller
+    // has just written (getNode takes it by value); reading those bytes in
+    // wider words than they were written in cannot be served from the
+    // pending writes, which holds each look-up back until the previous one
+    // has finished its memory accesses.
+    struct PathHash {
+        std::size_t operator()(std::string const& path) const noexcept
+        {
+            std::uint64_t h = 14695981039346656037ull; // FNV-1a
+            for (char c : path)
+                h = (h ^ static_cast<unsigned char>(c)) * 1099511628211ull;
+            return static_cast<std::size_t>(h);
+        }
+    };
+
     // By sensor type (ascending): what getMap lists.
     std::map<Node::SensorType, TypeList> sensorMap;
     // The id index and the path cache, by node id.
     std::unordered_map<unsigned int, IdEntry> idMap;
     // Node by path; the first node to claim a path keeps it.
-    std::unordered_map<std::string, Node*> nodePathMap;
+    std::unordered_map<std::string, Node*, PathHash> nodePathMap;
     // The keys of nodePathMap that lead to each node, so that removing a
     // node needs no walk of nodePathMap.
     std::unordered_multimap<Node*, std::string const*> pathsOfNode;
