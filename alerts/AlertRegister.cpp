@@ -28,22 +28,9 @@ AlertBatch::AlertBatch(NodeStore& store, std::vector<Alert> const& alerts)
     for (std::size_t a = 0; a < alerts.size(); ++a) {
         auto const& nodePaths = alerts[a].nodePaths();
         sensors[a].reserve(nodePaths.size());
-        for (std::string const& path : nodePaths) {
-            auto& naming = byPath[path];
-            if (naming.empty() || naming.back() != a)
-                naming.push_back(a);
-            Node::SensorType const sensor = store.nodePathToSensor(path);
-            if (sensor == Node::invalid)
-                unknownPath = true;
-            sensors[a].push_back(sensor);
-        }
+        for (std::string const& path : nodePaths)
+            sensors[a].push_back(store.nodePathToSensor(path));
     }
-}
-
-std::vector<std::size_t> const* AlertBatch::alertsNaming(std::string const& path) const
-{
-    auto it = byPath.find(path);
-    return it == byPath.end() ? nullptr : &it->second;
 }
 
 // ------------------------------------------------------------------ AlertCall
@@ -55,15 +42,21 @@ AlertCall::AlertCall(AlertCallBack callback, void const* context)
 
 void AlertCall::add(Alert alert, std::vector<std::string>& paths)
 {
-    alerts.emplace_back(alert.getSeverity(), alert.getClass(), paths, alert.getStatus(),
-                        alert.getMessage());
+    addRestricted(alert, paths);
+}
+
+void AlertCall::addRestricted(Alert const& alert, std::vector<std::string> paths)
+{
+    alerts.emplace_back(alert.getSeverity(), alert.getClass(), std::move(paths),
+                        alert.getStatus(), alert.getMessage());
 }
 
 void AlertCall::callBack(AlertStore& store, unsigned int type)
 {
-    std::vector<Alert> const delivered = alerts;
-    store.newAlerts(delivered, type);
-    callback(delivered, context);
+    // The call owns its alerts and nothing changes them while they are
+    // recorded and delivered, so they go out as they are.
+    store.newAlerts(alerts, type);
+    callback(alerts, context);
 }
 
 // -------------------------------------------------------------- AlertRegister
@@ -183,35 +176,6 @@ bool AlertRegister::filterAlerts(AlertBatch const& batch, std::vector<Alert> con
     }
     AlertCall call(callback, context);
     std::vector<std::string> matched;
-
-    // A register that filters by path alone can only take alerts that name
-    // one of its paths; the others it would pass over without a word unless
-    // their every alert is logged or a path is unknown.
-    bool const pathsOnly = classes.empty() && sensorTypes.empty() && !batch.hasUnknownPath() &&
-                           !HGLog::HGLogger::isEnabled(ALERT_REGISTER::loggerAlertRegister, 3000);
-    if (pathsOnly) {
-        std::vector<std::size_t> candidates;
-        if (nodePaths.size() <= batch.distinctPaths()) {
-            for (std::string const& path : nodePaths)
-                if (auto const* naming = batch.alertsNaming(path))
-                    candidates.insert(candidates.end(), naming->begin(), naming->end());
-        } else {
-            for (auto const& entry : batch.paths())
-                if (nodePaths.count(entry.first) != 0)
-                    candidates.insert(candidates.end(), entry.second.begin(), entry.second.end());
-        }
-        std::sort(candidates.begin(), candidates.end());
-        candidates.erase(std::unique(candidates.begin(), candidates.end()), candidates.end());
-        for (std::size_t a : candidates) {
-            matched.clear();
-            for (std::string const& path : alerts[a].nodePaths())
-                if (nodePaths.count(path) != 0)
-                    matched.push_back(path);
-            call.add(alerts[a], matched);
-        }
-        calls.push_back(std::move(call));
-        return false;
-    }
 
     for (std::size_t a = 0; a < alerts.size(); ++a) {
         Alert const& alert = alerts[a];

@@ -11,12 +11,19 @@
 
 #include <algorithm>
 #include <atomic>
+#include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <ostream>
 #include <set>
+#include <unordered_set>
 
 namespace IC {
+namespace ALERT_REGISTER {
+extern std::string loggerAlertRegister;
+} // namespace ALERT_REGISTER
+
 namespace InstCtrl {
 
 // The library's state, constructed in this order when the library is loaded.
@@ -380,38 +387,126 @@ Error AssertCallBackFP(std::vector<Alert> const& alerts)
     return success();
 }
 
+namespace {
+
+// A register found in an index for one alert: through the alert's class
+// (every path) or through path number `path` of the alert.
+struct Hit {
+    static constexpr std::uint32_t kAllPaths = 0xFFFFFFFFu;
+    AlertRegister* reg;
+    std::uint32_t alert;
+    std::uint32_t path;
+};
+
+bool operator<(Hit const& x, Hit const& y)
+{
+    if (x.reg != y.reg)
+        return std::less<AlertRegister*>()(x.reg, y.reg);
+    if (x.alert != y.alert)
+        return x.alert < y.alert;
+    return x.path < y.path;
+}
+
+bool operator==(Hit const& x, Hit const& y)
+{
+    return x.reg == y.reg && x.alert == y.alert && x.path == y.path;
+}
+
+// Paths erased from nodepathTOalertregister by removal alerts while a
+// register held them: those registers keep the paths in their own sets, so
+// for a batch naming one, the index alone does not tell what they match.
+// Guarded by registerlock.
+std::unordered_set<std::string> pathsBeyondIndex;
+
+// One register's delivery worked out from the index hits alone, which name
+// exactly what its filter would match when every path of the batch has a
+// node and every path the register holds is indexed. Hits are sorted and
+// hold one register.
+AlertCall deliveryFromHits(AlertRegister const& reg, std::vector<Alert> const& alerts,
+                           Hit const* first, Hit const* last)
+{
+    AlertCall call(reg.getCallback(), reg.getContext());
+    while (first != last) {
+        Alert const& alert = alerts[first->alert];
+        Hit const* const end = std::find_if(
+            first, last, [first](Hit const& h) { return h.alert != first->alert; });
+        std::vector<std::string> matched;
+        if (end[-1].path == Hit::kAllPaths) {
+            matched = alert.nodePaths();
+        } else {
+            matched.reserve(static_cast<std::size_t>(end - first));
+            for (Hit const* h = first; h != end; ++h)
+                matched.push_back(alert.nodePaths()[h->path]);
+        }
+        if (!matched.empty()) // a class match of an alert without paths
+            call.addRestricted(alert, std::move(matched));
+        first = end;
+    }
+    return call;
+}
+
+} // namespace
+
 Error AlertCallBackCommon(std::vector<Alert> const& alerts, void const*, MyAlertType type)
 {
     std::vector<std::string> removed;
     std::vector<AlertCall> calls;
     {
         SD::MutexGuard guard(registerlock);
-        // Each path's sensor type is looked up once for the whole batch.
-        AlertBatch const batch(nodestore, alerts);
-        std::set<AlertRegister*> selected;
+        if (callbacks.empty())
+            pathsBeyondIndex.clear(); // no register holds a path any more
+        std::unordered_set<std::string> removedSeen;
+        std::vector<Hit> hits;
+        hits.reserve(alerts.size() * 2);
+        bool exact = !HGLog::HGLogger::isEnabled(ALERT_REGISTER::loggerAlertRegister, 3000);
         for (std::size_t a = 0; a < alerts.size(); ++a) {
             Alert const& alert = alerts[a];
+            auto const n = static_cast<std::uint32_t>(a);
             auto byClass = classtypeTOalertregister.equal_range(alert.getClass());
             for (auto it = byClass.first; it != byClass.second; ++it)
-                selected.insert(it->second);
+                hits.push_back(Hit{it->second, n, Hit::kAllPaths});
             auto const& paths = alert.nodePaths();
             for (std::size_t p = 0; p < paths.size(); ++p) {
                 std::string const& path = paths[p];
-                if (alert.getClass() == Alert::NodeRemoval &&
-                    std::find(removed.begin(), removed.end(), path) == removed.end())
+                auto const at = static_cast<std::uint32_t>(p);
+                if (alert.getClass() == Alert::NodeRemoval && removedSeen.insert(path).second)
                     removed.push_back(path);
-                auto bySensor = sensortypeTOalertregister.equal_range(batch.sensorOf(a, p));
+                Node::SensorType const sensor = nodestore.nodePathToSensor(path);
+                if (sensor == Node::invalid ||
+                    (!pathsBeyondIndex.empty() && pathsBeyondIndex.count(path) != 0))
+                    exact = false;
+                auto bySensor = sensortypeTOalertregister.equal_range(sensor);
                 for (auto it = bySensor.first; it != bySensor.second; ++it)
-                    selected.insert(it->second);
+                    hits.push_back(Hit{it->second, n, at});
                 auto byPath = nodepathTOalertregister.equal_range(path);
                 for (auto it = byPath.first; it != byPath.second; ++it)
-                    selected.insert(it->second);
+                    hits.push_back(Hit{it->second, n, at});
             }
         }
-        calls.reserve(selected.size());
-        for (AlertRegister* reg : selected)
-            if (reg->filterAlerts(batch, alerts, calls, type))
+        std::sort(hits.begin(), hits.end());
+        hits.erase(std::unique(hits.begin(), hits.end()), hits.end());
+        // Every register found is given its turn, in ascending address. The
+        // full filter runs whenever something would be logged or the hits
+        // may not tell the whole match.
+        std::unique_ptr<AlertBatch> batch;
+        for (auto first = hits.begin(); first != hits.end();) {
+            AlertRegister* const reg = first->reg;
+            auto const last = std::find_if(first, hits.end(),
+                                           [reg](Hit const& h) { return h.reg != reg; });
+            bool cleaned = false;
+            if (exact && reg->getCallback()) {
+                // Clients see only what functional plug-ins raise.
+                if (reg->getRegType() != CLIENT_REGISTRATION || type != MI_ALERT)
+                    calls.push_back(deliveryFromHits(*reg, alerts, &*first, &*first + (last - first)));
+            } else {
+                if (!batch)
+                    batch = std::make_unique<AlertBatch>(nodestore, alerts);
+                cleaned = reg->filterAlerts(*batch, alerts, calls, type);
+            }
+            if (cleaned)
                 IC_LOG(3000, "InstrumentationControl ER_CLEANED from AlertRegister ", reg);
+            first = last;
+        }
     }
     // Callbacks run without the lock, so that they may register and
     // deregister themselves.
@@ -426,7 +521,8 @@ Error AlertCallBackCommon(std::vector<Alert> const& alerts, void const*, MyAlert
         SD::MutexGuard guard(registerlock);
         for (std::string const& path : removed) {
             nodestore.erase(path);
-            nodepathTOalertregister.erase(path);
+            if (nodepathTOalertregister.erase(path) != 0)
+                pathsBeyondIndex.insert(path);
         }
     }
     return success();

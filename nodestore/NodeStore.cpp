@@ -6,6 +6,7 @@
 #include "../frame/HexText.h"
 
 #include <algorithm>
+#include <iterator>
 #include <stdexcept>
 #include <utility>
 
@@ -26,14 +27,31 @@ namespace {
 
 unsigned int const kAllPairs = Node::invalid;
 
+using Guard = std::lock_guard<std::recursive_mutex>;
+
 Error status(unsigned char s)
 {
     return Error(s, Number(Number::Generic), std::string());
 }
 
-bool isPathLetter(char c)
+// The two results of look-ups, built once: a copy costs far less than a
+// construction, and look-ups are the store's hottest path.
+Error const& found()
 {
-    return c >= 'a' && c <= 'p';
+    static Error const e = status(0);
+    return e;
+}
+Error const& notFound()
+{
+    static Error const e = status(1);
+    return e;
+}
+
+// The nodes of a getMap list, without the holes removals left.
+void appendListed(std::vector<Node*> const& listed, std::vector<Node*>& nodes)
+{
+    std::copy_if(listed.begin(), listed.end(), std::back_inserter(nodes),
+                 [](Node* n) { return n != nullptr; });
 }
 
 } // namespace
@@ -64,13 +82,44 @@ void NodeStore::unlist(Node* node)
     auto type = sensorMap.find(static_cast<Node::SensorType>(*node));
     if (type == sensorMap.end())
         return;
-    auto& listed = type->second;
-    auto it = std::find(listed.begin(), listed.end(), node);
-    if (it == listed.end())
+    TypeList& listed = type->second;
+    // The node's first place in order of addition goes.
+    auto range = listed.positions.equal_range(node);
+    if (range.first == range.second)
         return;
-    listed.erase(it);
-    if (listed.empty())
+    auto first = range.first;
+    for (auto it = range.first; it != range.second; ++it)
+        if (it->second < first->second)
+            first = it;
+    listed.nodes[first->second] = nullptr;
+    listed.positions.erase(first);
+    std::size_t const live = listed.positions.size();
+    if (live == 0) {
         sensorMap.erase(type);
+        return;
+    }
+    // Closing the holes once they outnumber the nodes keeps each removal
+    // constant on average and getMap proportional to what it lists.
+    std::size_t const holes = listed.nodes.size() - live;
+    if (holes <= live || holes < 64)
+        return;
+    std::vector<std::size_t> moved(listed.nodes.size());
+    std::size_t next = 0;
+    for (std::size_t i = 0; i < listed.nodes.size(); ++i) {
+        moved[i] = next;
+        if (listed.nodes[i])
+            listed.nodes[next++] = listed.nodes[i];
+    }
+    listed.nodes.resize(next);
+    for (auto& place : listed.positions)
+        place.second = moved[place.second];
+}
+
+void NodeStore::list(Node* node)
+{
+    TypeList& listed = sensorMap[static_cast<Node::SensorType>(*node)];
+    listed.positions.emplace(node, listed.nodes.size());
+    listed.nodes.push_back(node);
 }
 
 // ---------------------------------------------------------------- registry
@@ -97,7 +146,7 @@ Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
     isNew = false;
     if (!node)
         return status(1);
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     // The path is computed once: registering caches what this walk found,
     // exactly as computing it again would.
     std::vector<PendingPath> pending;
@@ -105,7 +154,7 @@ Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
     if (nodePathMap.count(path) != 0)
         return status(0);
     // Listed before the id is entered, and kept even if the id is taken.
-    sensorMap[static_cast<Node::SensorType>(*node)].push_back(node);
+    list(node);
     Error result = add2NodeMapWalked(node, path, pending);
     isNew = result.getStatus() == 0;
     return result;
@@ -113,7 +162,7 @@ Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
 
 Error NodeStore::addMINode(std::vector<Node*> const& nodes)
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     Error result = status(0);
     std::vector<PendingPath> pending;
     for (Node* node : nodes) {
@@ -179,7 +228,7 @@ Error NodeStore::add2NodeMap(std::vector<Node*> const& nodes)
 
 Error NodeStore::delNode(Node* const& node)
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     delOneNode(node);
     return status(0);
 }
@@ -198,20 +247,22 @@ void NodeStore::delOneNode(Node* const& node)
         if (!byId->second.node)
             idMap.erase(byId);
     }
-    // Of the paths that lead to this node, the smallest goes. Removals are
-    // rare, so this walks the whole index instead of keeping a reverse one.
-    auto smallest = nodePathMap.end();
-    for (auto it = nodePathMap.begin(); it != nodePathMap.end(); ++it)
-        if (it->second == node && (smallest == nodePathMap.end() || it->first < smallest->first))
-            smallest = it;
-    if (smallest != nodePathMap.end())
-        nodePathMap.erase(smallest);
+    // Of the paths that lead to this node, the smallest goes.
+    auto range = pathsOfNode.equal_range(node);
+    if (range.first != range.second) {
+        auto smallest = range.first;
+        for (auto it = range.first; it != range.second; ++it)
+            if (*it->second < *smallest->second)
+                smallest = it;
+        nodePathMap.erase(nodePathMap.find(*smallest->second));
+        pathsOfNode.erase(smallest);
+    }
     unlist(node);
 }
 
 void NodeStore::erase(std::string path)
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     Node* node = nullptr;
     if (nodePath2Node(std::move(path), &node).getStatus() == 0)
         delOneNode(node);
@@ -219,7 +270,7 @@ void NodeStore::erase(std::string path)
 
 void NodeStore::delNodeFromGetMap(std::string const& path)
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     Node* node = nullptr;
     if (nodePath2Node(path, &node).getStatus() == 0)
         unlist(node);
@@ -229,7 +280,8 @@ void NodeStore::clear()
 {
     // Callers need not hold the lock; taking it costs nothing when they do
     // and keeps a first open safe against a client still querying.
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
+    pathsOfNode.clear();
     nodePathMap.clear();
     idMap.clear();
     sensorMap.clear();
@@ -237,58 +289,68 @@ void NodeStore::clear()
 
 Error NodeStore::getNode(unsigned int id, Node** node) const
 {
-    SD::MutexGuard guard(storeLock);
-    return nodeId2Node(id, node);
+    // Looked up here rather than through nodeId2Node: an exported member is
+    // called through the procedure linkage table, which this path avoids.
+    Guard guard(storeLock);
+    auto it = idMap.find(id);
+    if (it == idMap.end() || !it->second.node)
+        return notFound();
+    *node = it->second.node;
+    return found();
 }
 
 Error NodeStore::getNode(std::string path, Node** node) const
 {
-    SD::MutexGuard guard(storeLock);
-    return nodePath2Node(std::move(path), node);
+    Guard guard(storeLock);
+    auto it = nodePathMap.find(path);
+    if (it == nodePathMap.end())
+        return notFound();
+    *node = it->second;
+    return found();
 }
 
 Error NodeStore::nodeId2Node(unsigned int id, Node** node) const
 {
-    Node* const found = registeredNode(id);
-    if (!found)
-        return status(1);
-    *node = found;
-    return status(0);
+    Node* const registered = registeredNode(id);
+    if (!registered)
+        return notFound();
+    *node = registered;
+    return found();
 }
 
 Error NodeStore::nodePath2Node(std::string path, Node** node) const
 {
     auto it = nodePathMap.find(path);
     if (it == nodePathMap.end())
-        return status(1);
+        return notFound();
     *node = it->second;
-    return status(0);
+    return found();
 }
 
 Error NodeStore::getMap(std::vector<Node*>& nodes) const
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     nodes.clear();
     for (auto const& type : sensorMap)
-        nodes.insert(nodes.end(), type.second.begin(), type.second.end());
-    return status(0);
+        appendListed(type.second.nodes, nodes);
+    return found();
 }
 
 Error NodeStore::getMap(std::vector<Node*>& nodes, unsigned int sensor) const
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     nodes.clear();
     auto type = sensorMap.find(static_cast<Node::SensorType>(sensor));
     if (type != sensorMap.end())
-        nodes = type->second;
-    return status(0);
+        appendListed(type->second.nodes, nodes);
+    return found();
 }
 
 Error NodeStore::getAllNodes(std::vector<Node*>& nodes) const
 {
     std::vector<std::pair<unsigned int, Node*> > byId;
     {
-        SD::MutexGuard guard(storeLock);
+        Guard guard(storeLock);
         byId.reserve(idMap.size());
         for (auto const& entry : idMap)
             if (entry.second.node)
@@ -326,7 +388,9 @@ void NodeStore::cachePaths(std::vector<PendingPath> const& pending)
         std::string& cached = idMap[p.node->getNodeId()].path;
         if (cached.empty())
             cached = p.path;
-        nodePathMap.emplace(p.path, p.node);
+        auto const added = nodePathMap.emplace(p.path, p.node);
+        if (added.second)
+            pathsOfNode.emplace(p.node, &added.first->first);
     }
 }
 
@@ -380,7 +444,7 @@ std::string NodeStore::getNodePath(Node* node)
 {
     if (!node)
         return std::string();
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     return calcNodePath(node);
 }
 
@@ -416,7 +480,7 @@ std::string NodeStore::getNodeHierarchy(Node* node)
 
 Node::SensorType NodeStore::nodePathToSensor(std::string path) const
 {
-    SD::MutexGuard guard(storeLock);
+    Guard guard(storeLock);
     Node* node = nullptr;
     if (nodePath2Node(std::move(path), &node).getStatus() == 0)
         return node->getSensor();
@@ -564,31 +628,40 @@ void NodeStore::uniqueid2topovec(std::string uid, unsigned int stop, TopoVec& to
 
 std::string NodeStore::nodecode(TopoVec topovec) const
 {
-    std::string letters;
-    for (auto const& pair : topovec) {
-        letters += int2chr(pair.second);
-        letters += 'p';
-        letters += int2chr(pair.first);
-        letters += 'a';
+    // Only an empty list can be damaged: every pair gives valid letters.
+    if (topovec.empty()) {
+        NS_LOG(6000, "nodecode: Damaged node string ='", "", "'");
+        throw std::invalid_argument("Damaged node string");
     }
-    std::size_t const length = letters.size();
-    if (length == 1)
-        return std::string();
+    // The letters go straight to nibbles (a=0 .. p=15), packed two to a
+    // byte; a final odd nibble, always the closing "a", is dropped.
     std::string out;
-    out.reserve(length / 2);
-    for (std::size_t i = 0;;) {
-        char const hi = i < length ? letters[i] : '\0';
-        char const lo = i + 1 < length ? letters[i + 1] : '\0';
-        if (!isPathLetter(hi) || !isPathLetter(lo)) {
-            NS_LOG(6000, "nodecode: Damaged node string ='", letters, "'");
-            throw std::invalid_argument("Damaged node string");
+    out.reserve(topovec.size() * 3);
+    int high = -1;
+    auto const put = [&out, &high](unsigned int nibble) {
+        if (high < 0) {
+            high = static_cast<int>(nibble);
+            return;
         }
-        char const byte = static_cast<char>((hi - 'a') * 16 + (lo - 'a'));
-        if (byte != 0)
+        if (char const byte = static_cast<char>(high << 4 | static_cast<int>(nibble)))
             out += byte;
-        i += 2;
-        if (length - 1 <= i)
-            break;
+        high = -1;
+    };
+    auto const putNumber = [&put](unsigned int n) {
+        unsigned char digits[12];
+        std::size_t count = 0;
+        do {
+            digits[count++] = static_cast<unsigned char>(1 + n % 12);
+            n /= 12;
+        } while (n != 0);
+        while (count != 0)
+            put(digits[--count]);
+    };
+    for (auto const& pair : topovec) {
+        putNumber(pair.second);
+        put(15);
+        putNumber(pair.first);
+        put(0);
     }
     return out;
 }

@@ -8,6 +8,7 @@
 #include "StoreSupport.h"
 
 #include <cstdint>
+#include <memory>
 
 namespace {
 
@@ -325,3 +326,42 @@ TEST_F(SimpleAlerts, OneCallPerPathWithTheClassesCodeUnderTheLockAndTheSmallestF
 }
 
 } // namespace
+
+TEST_F(Dispatch, ARemovalNamingManyPathsDropsExactlyThoseAndRegistersStillMatchThePathsTheIndexDropped)
+{
+    std::vector<std::unique_ptr<IC::Node>> sensors;
+    Paths all, even;
+    for (unsigned int i = 0; i < 300; ++i) {
+        sensors.push_back(std::make_unique<IC::Node>(ST::TemperatureSensor, i, 1000 + i, 1, "t"));
+        ASSERT_TRUE(ictest::addNew(ICC::nodestore, *sensors.back()));
+        all.push_back(sensors.back()->getPath());
+        if (i % 2 == 0)
+            even.push_back(all.back());
+    }
+    ICC::registerForAlerts(recA, Paths{P0, all[4], all[5]}, &c1);
+    expectError(ICC::AlertCallBackFP({alert(4, even)}), 0);
+    EXPECT_EQ(gDeliveries, (Deliveries{{1, "3/4/2/m/" + hex(all[4]) + ","}}));
+    for (unsigned int i = 0; i < 300; ++i)
+        EXPECT_EQ(ICC::nodestore.nodePathToSensor(all[i]), i % 2 ? ST::TemperatureSensor : ST::invalid) << i;
+    EXPECT_EQ(indexed(), (Keys{"path " + hex(P0), "path " + hex(all[5])}));
+    // Back under its path, the node is matched through the register's own
+    // set wherever the register is found, though the index lost the path.
+    ASSERT_TRUE(ictest::addNew(ICC::nodestore, *sensors[4]));
+    struct Case {
+        Paths paths;
+        Deliveries expected;
+    } const cases[] = {
+        {{all[4]}, {}},
+        {{all[4], P0}, {{1, "3/0/2/m/" + hex(all[4]) + "," + hex(P0) + ","}}},
+        {{all[5], all[6], all[4]}, {{1, "3/0/2/m/" + hex(all[5]) + "," + hex(all[4]) + ","}}},
+    };
+    for (Case const& c : cases) {
+        gDeliveries.clear();
+        expectError(ICC::AlertCallBackFP({alert(0, c.paths)}), 0);
+        EXPECT_EQ(gDeliveries, c.expected) << c.paths.size();
+    }
+    ICC::registerForAlerts(recA, cls(7), &c2);
+    gDeliveries.clear();
+    ICC::AlertCallBackFP({alert(7, {})});
+    EXPECT_EQ(gDeliveries, (Deliveries{{2, ""}})) << "a class match of no path: an empty call";
+}

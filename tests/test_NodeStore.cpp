@@ -5,7 +5,9 @@
 
 #include "StoreSupport.h"
 
+#include <algorithm>
 #include <cstdint>
+#include <memory>
 #include <random>
 
 namespace {
@@ -361,3 +363,48 @@ TEST(NodeStoreConcurrency, ParallelAddsAndQueriesLeaveEveryIndexConsistent)
 }
 
 } // namespace
+
+TEST_F(NodeStoreTest, ManyRemovalsDropExactlyTheNamedNodesAndAFurtherRemovalTheNextPathOfTheNode)
+{
+    // 500 sensors; 400 of them erased by path in random order, so that the
+    // getMap list closes its holes several times on the way.
+    ASSERT_TRUE(addNew(store, root));
+    std::vector<std::unique_ptr<Node>> sensors;
+    std::vector<std::size_t> order;
+    for (unsigned int i = 0; i < 500; ++i) {
+        sensors.push_back(std::make_unique<Node>(ST::TemperatureSensor, i, 100 + i, 1, ""));
+        ASSERT_TRUE(addNew(store, *sensors.back()));
+        order.push_back(i);
+    }
+    std::shuffle(order.begin(), order.end(), std::mt19937(5));
+    std::vector<bool> gone(500, false);
+    for (std::size_t k = 0; k < 400; ++k) {
+        gone[order[k]] = true;
+        store.delNodeFromGetMap(sensors[order[k]]->getPath());
+        store.erase(sensors[order[k]]->getPath());
+    }
+    Nodes left;
+    for (unsigned int i = 0; i < 500; ++i) {
+        Node* const n = sensors[i].get();
+        Node* const expected = gone[i] ? nullptr : n;
+        EXPECT_EQ(found(store, 100 + i, n->getPath()), (Nodes{expected, expected})) << i;
+        if (!gone[i])
+            left.push_back(n);
+    }
+    EXPECT_EQ(listed(store, ST::TemperatureSensor), left);
+    // A node under two paths: each removal takes the smaller of those left,
+    // whichever was computed first.
+    for (bool smallerFirst : {false, true}) {
+        Node twice(ST::Fan, smallerFirst ? 1 : 2, smallerFirst ? 20 : 9, 1, "twice");
+        std::string const first = store.getNodePath(&twice);
+        twice.setNodeId(twice.getNodeId() + 1);
+        twice.setInstance(smallerFirst ? 2 : 1);
+        std::string const second = store.getNodePath(&twice);
+        std::string const& smaller = smallerFirst ? first : second;
+        std::string const& larger = smallerFirst ? second : first;
+        expectError(store.delNode(&twice), 0);
+        EXPECT_EQ(found(store, smaller, larger), (Nodes{nullptr, &twice})) << smallerFirst;
+        expectError(store.delNode(&twice), 0);
+        EXPECT_EQ(found(store, larger), Nodes{nullptr}) << smallerFirst;
+    }
+}

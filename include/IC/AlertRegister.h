@@ -16,7 +16,6 @@
 #include <cstddef>
 #include <cstdint>
 #include <set>
-#include <unordered_map>
 #include <string>
 #include <vector>
 
@@ -39,28 +38,16 @@ using SimpleAlertCallBack = void (*)(unsigned int code, SD::DateTime time, std::
                                      void const* context);
 
 // What a dispatch works out once per batch and every register reuses: the
-// sensor type of each node path (74 when no node has it) and which alerts
-// name each path.
+// sensor type of each node path (74 when no node has it).
 class IC_API AlertBatch {
 public:
     AlertBatch(NodeStore& store, std::vector<Alert> const& alerts);
 
     // Sensor type of path number p of alert number a.
     Node::SensorType sensorOf(std::size_t a, std::size_t p) const { return sensors[a][p]; }
-    // True when some path of the batch names no node.
-    bool hasUnknownPath() const { return unknownPath; }
-    // Ascending numbers of the alerts that name path; null when none does.
-    std::vector<std::size_t> const* alertsNaming(std::string const& path) const;
-    std::size_t distinctPaths() const { return byPath.size(); }
-    std::unordered_map<std::string, std::vector<std::size_t> > const& paths() const
-    {
-        return byPath;
-    }
 
 private:
     std::vector<std::vector<Node::SensorType> > sensors;
-    std::unordered_map<std::string, std::vector<std::size_t> > byPath;
-    bool unknownPath = false;
 };
 
 // One pending delivery: the alerts one register takes from a batch.
@@ -71,6 +58,8 @@ public:
     // Appends a copy of alert carrying only the given paths (and a new time
     // stamp).
     void add(Alert alert, std::vector<std::string>& paths);
+    // The same without copying alert first.
+    void addRestricted(Alert const& alert, std::vector<std::string> paths);
     // Records the alerts in store (for the batch type), then calls the
     // callback with them.
     void callBack(AlertStore& store, unsigned int type);

@@ -8,7 +8,9 @@
 //
 // Indexes are hash tables; the orders that callers see are kept: getMap
 // lists by ascending sensor type and order of addition, and removing a node
-// drops the smallest of the paths under which it is registered.
+// drops the smallest of the paths under which it is registered. Every
+// per-node operation, removal included, costs the same whatever the size of
+// the store.
 //
 // Path code: each pair is written as its instance in base 12 (letters b..m,
 // most significant first), "p", its sensor type in base 12, "a"; the letter
@@ -19,9 +21,10 @@
 #include <IC/Error.h>
 #include <IC/Export.h>
 #include <IC/Node.h>
-#include <SD/Mutex.h>
-
+#include <cstddef>
+#include <cstdint>
 #include <map>
+#include <mutex>
 #include <unordered_map>
 #include <string>
 #include <utility>
@@ -141,15 +144,45 @@ private:
                             std::vector<PendingPath> const& pending);
     Node* registeredNode(unsigned int id) const;
     std::string const* cachedPath(unsigned int id) const;
+    // Enters the node last in the getMap list of its type.
+    void list(Node* node);
+    // Removes the node's first entry from the getMap list of its type.
     void unlist(Node* node);
 
-    // By sensor type (ascending), in order of addition: what getMap lists.
-    std::map<Node::SensorType, std::vector<Node*> > sensorMap;
+    // The nodes of one sensor type in order of addition. A removed node
+    // leaves a hole until holes outnumber nodes; positions finds a node's
+    // places without a search.
+    struct TypeList {
+        std::vector<Node*> nodes;
+        std::unordered_multimap<Node*, std::size_t> positions;
+    };
+
+    // Hashes a path a byte at a time. A look-up's path is a copy its caller
+    // has just written (getNode takes it by value); reading those bytes in
+    // wider words than they were written in cannot be served from the
+    // pending writes, which holds each look-up back until the previous one
+    // has finished its memory accesses.
+    struct PathHash {
+        std::size_t operator()(std::string const& path) const noexcept
+        {
+            std::uint64_t h = 14695981039346656037ull; // FNV-1a
+            for (char c : path)
+                h = (h ^ static_cast<unsigned char>(c)) * 1099511628211ull;
+            return static_cast<std::size_t>(h);
+        }
+    };
+
+    // By sensor type (ascending): what getMap lists.
+    std::map<Node::SensorType, TypeList> sensorMap;
     // The id index and the path cache, by node id.
     std::unordered_map<unsigned int, IdEntry> idMap;
     // Node by path; the first node to claim a path keeps it.
-    std::unordered_map<std::string, Node*> nodePathMap;
-    mutable SD::Mutex storeLock;
+    std::unordered_map<std::string, Node*, PathHash> nodePathMap;
+    // The keys of nodePathMap that lead to each node, so that removing a
+    // node needs no walk of nodePathMap.
+    std::unordered_multimap<Node*, std::string const*> pathsOfNode;
+    // Re-entrant: path computations look nodes up under the lock they hold.
+    mutable std::recursive_mutex storeLock;
 };
 
 } // namespace IC
