@@ -275,13 +275,16 @@ private:
         }
         delete this;
     }
-    // Local ids count up from 1 in the order of creation.
-    Node* add(Node::SensorType type, unsigned int instance, unsigned int localParent, std::string const& description)
+    // Local ids count up from 1 in the order of creation. Nodes reported
+    // through the arrival callback are not in the map as well.
+    Node* add(Node::SensorType type, unsigned int instance, unsigned int localParent, std::string const& description,
+              bool mapped = true)
     {
         unsigned int const id = base_ | ++lastLocalId_, parent = localParent == 0 ? 0 : (base_ | localParent);
         owned_.push_back(std::make_unique<Node>(type, instance, id, parent, description, id));
-        live_.push_back(owned_.back().get());
-        return live_.back();
+        if (mapped)
+            live_.push_back(owned_.back().get());
+        return owned_.back().get();
     }
     bool waitStop(long ms)
     {
@@ -313,7 +316,7 @@ private:
                 Node* fan;
                 {
                     std::lock_guard<std::mutex> g(m_);
-                    fan = add(Node::Fan, 0x10 + turn, 2, kName + " fan");
+                    fan = add(Node::Fan, 0x10 + turn, 2, kName + " fan", false);
                 }
                 if (seen_->arrival(fan, seen_->arrivalContext).getStatus() == 0)
                     fans.push_back(fan->getPath());
