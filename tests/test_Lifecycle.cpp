@@ -229,6 +229,8 @@ TEST_F(Lifecycle, EachQueryLogsOneLineAndAnswersFromTheNodeStore)
         {"getAllNodes:", [&] { return ic->getAllNodes(nodes).getStatus() == 0 && nodes.size() == 8u; }},
         {"getNodeHierarchy: ",
          [&] { return ic->getNodeHierarchy(cpu) == "ROOT:00000000->Chassis:00000000->CPU:00000000"; }},
+        {"getModuleVersion:", [&] { return ic->getModuleVersion() == IC::Number(IC::Version2{1, 0}); }},
+        {"getInterfaceVersion:", [&] { return ic->getInterfaceVersion() == IC::Number(IC::Version2{1, 0}); }},
         {"getNodeHierarchy: parent sensor 1", [&] {
              return ic->getNodeHierarchy(alpha.nodes[3], IC::Node::Chassis) ==
                     "Chassis:00000000->CPU:00000000->Temperature Sensor:00000000";
@@ -238,6 +240,9 @@ TEST_F(Lifecycle, EachQueryLogsOneLineAndAnswersFromTheNodeStore)
         EXPECT_TRUE(q.answer()) << q.message;
         EXPECT_EQ(cap.messages(kLogIC), Strings{q.message});
     }
+    ictest::LogCapture cap;
+    IST::diagError(nullptr, "ctx");
+    EXPECT_EQ(cap.messages(kLogIC).at(0).rfind("ctx: ", 0), 0u) << "a null error is reported, not dereferenced";
 }
 
 // A node that does not take the path the store gives it.

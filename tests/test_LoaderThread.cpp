@@ -5,8 +5,6 @@
 
 #include "PluginHarness.h"
 
-#include <dlfcn.h>
-
 namespace {
 
 using ictest::kLogIC;
@@ -54,16 +52,6 @@ TEST(LoaderThreadAlone, CallsItsFunctionEveryPeriodUntilStopped)
     EXPECT_EQ(calls.load(), seen);
     IC::LoaderThread failing(0, 1, [] { throw std::runtime_error("reload broke"); });
     EXPECT_THROW(failing.run(nullptr), std::runtime_error);
-}
-
-// A host may derive its own loader thread from the class: the type's
-// run-time information is part of the library's interface.
-TEST(LoaderThreadExport, ItsTypeInformationIsExported)
-{
-    void* lib = dlopen(IC_LIBRARY_PATH, RTLD_NOW | RTLD_LOCAL);
-    ASSERT_NE(lib, nullptr) << dlerror();
-    EXPECT_TRUE(dlsym(lib, "_ZTIN2IC12LoaderThreadE") && dlsym(lib, "_ZTVN2IC12LoaderThreadE"));
-    dlclose(lib);
 }
 
 // ---- installed in the library ----
