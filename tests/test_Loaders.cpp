@@ -1,5 +1,7 @@
-// Management-interface loading, removal and reload (IC::MIControl), driven
-// directly with local lists and a local node store, against real plug-ins.
+// Plug-in discovery (IC::LoadControl), and loading, removal and reload of
+// management interfaces (IC::MIControl) and functional plug-ins
+// (IC::FPControl), driven directly with local lists and a local node store,
+// against real plug-ins.
 #include <IC/FPControl.h>
 #include <IC/MIControl.h>
 #include <IC/NodeStore.h>
@@ -7,11 +9,14 @@
 #include "PluginHarness.h"
 #include "Recorders.h"
 
+#include <sys/stat.h>
 #include <typeinfo>
+#include <unistd.h>
 
 namespace {
 
 using ictest::expectError;
+using ictest::kLogFP;
 using ictest::kLogMI;
 using ictest::recs;
 using ictest::seen;
@@ -19,12 +24,77 @@ using Strings = std::vector<std::string>;
 using MIs = std::vector<IC::ManagementInterface*>;
 
 int const kContext = 0; // stands for the facade
+IC::Number const kIV(IC::Version2{1, 0}), kMV(IC::Version2{2, 3});
 
 std::string err(char const* text) { return ictest::errText(IC::Error(1, IC::Number(7u), text)); }
 IC::ManagementInterface* object(ictest::Seen const& s) { return static_cast<IC::ManagementInterface*>(s.object); }
 std::size_t count(Strings const& v, std::string const& s) { return static_cast<std::size_t>(std::count(v.begin(), v.end(), s)); }
+// A reload of FPs announces nothing here (their nodes are not in the
+// store); a call would show as this error in its result.
+IC::Error sink(std::vector<IC::Alert> const&) { return IC::Error(1, IC::Number(99u), "not expected"); }
 
-class MIControlTest : public testing::Test {
+// Records follow those already there, in the directory's name order; what
+// does not open is left out. Every scan opens the libraries again, and a
+// separator after the directory changes only the paths.
+TEST(FindLibs, OpensEveryLibraryOfTheDirectoryInNameOrder)
+{
+    ictest::TempTree tree;
+    std::string const dir = tree.miDir();
+    tree.install(dir, "mi_alpha", "c.so");
+    tree.install(dir, "mi_beta", "a.so");
+    tree.write("mi/b.so", "this is not an ELF file");
+    tree.write("mi/readme.txt", "not a plug-in");
+    ASSERT_EQ(mkdir((dir + "/d.so").c_str(), 0700) + symlink((dir + "/c.so").c_str(), (dir + "/e.so").c_str()), 0);
+    std::vector<IC::libstruct> libs(1);
+    libs[0].name = "earlier.so";
+    std::set<std::string> names{"kept"};
+    ictest::LogCapture cap;
+    ictest::expectError(IC::LoadControl().findLibs(dir, libs, names), 0);
+    ictest::expectError(IC::LoadControl().findLibs(dir + "/", libs, names), 0);
+    EXPECT_EQ(names, std::set<std::string>{"kept"});
+    ASSERT_EQ(libs.size(), 7u);
+    for (std::size_t i = 1; i < libs.size(); ++i) {
+        std::string const name = std::string(1, "ace"[(i - 1) % 3]) + ".so";
+        EXPECT_EQ(libs[i].path, dir + (i > 3 ? "//" : "/") + name);
+        EXPECT_TRUE(libs[i].name == name && libs[i].handle && !libs[i].plugin && libs[i].idbase == 0u);
+    }
+    ictest::expectEvent(cap, {ictest::kLogLC, "LoadControl"}, "findLibs: Looking for directory " + dir, 3000,
+                        "findLibs");
+    EXPECT_EQ(cap.logs(ictest::kLogLC).size(), 12u) << "one line per directory and per file";
+    EXPECT_TRUE(ictest::isMapped(dir));
+    for (auto& r : libs)
+        SD::PlatformUtilities::unloadLibrary(r.handle);
+    EXPECT_FALSE(ictest::isMapped(dir));
+    libs.clear();
+    ictest::expectError(IC::LoadControl().findLibs(tree.path("none"), libs, names), 0);
+    EXPECT_TRUE(libs.empty());
+}
+
+IC::libstruct rec(std::string const& name, std::string const& path)
+{
+    IC::libstruct r;
+    r.name = name;
+    r.path = path;
+    return r;
+}
+
+// Only the bare name counts, compared byte by byte as unsigned characters,
+// a prefix first.
+TEST(LibOrder, BothLoadersCompareBareNamesByteWise)
+{
+    for (auto lt : {&IC::MI_CONTROL::libLT, &IC::FP_CONTROL::libLT}) {
+        std::vector<IC::libstruct> v{rec("mi_b.so", "/a"), rec("\xe2\x82\xac.so", "/e"), rec("mi_a.so", "/z"),
+                                     rec("MI.so", "/m"), rec("mi_a", "/n"), rec("\x7f", "/p")};
+        std::sort(v.begin(), v.end(), lt);
+        std::string names;
+        for (auto const& r : v)
+            names += r.name + " ";
+        EXPECT_EQ(names, "MI.so mi_a mi_a.so mi_b.so \x7f \xe2\x82\xac.so ");
+        EXPECT_FALSE(lt(rec("same.so", "/one"), rec("same.so", "/two")));
+    }
+}
+
+class Loaders : public testing::Test {
 protected:
     void SetUp() override { ictest::Recorder::get().reset(); }
     void TearDown() override
@@ -41,30 +111,41 @@ protected:
     IC::Error load()
     {
         toLoad_ = ictest::discover(tree_.miDir());
-        return IC::MIControl().myloadMIs(counter_, libs_, mis_, &ictest::recAlert, toLoad_, IC::Number(IC::Version2{1, 0}),
-                                         IC::Number(IC::Version2{2, 3}), store_, &ictest::recArrival, &kContext,
-                                         &ictest::recLookup);
+        return IC::MIControl().myloadMIs(counter_, libs_, mis_, &ictest::recAlert, toLoad_, kIV, kMV, store_,
+                                         &ictest::recArrival, &kContext, &ictest::recLookup);
     }
     IC::Error reload()
     {
-        return IC::MIControl().reLoadMIs(counter_, libs_, mis_, &ictest::recAlert, fps_, IC::Number(IC::Version2{1, 0}),
-                                         IC::Number(IC::Version2{2, 3}), store_, names_, &ictest::recArrival,
-                                         &kContext, &ictest::recLookup);
+        return IC::MIControl().reLoadMIs(counter_, libs_, mis_, &ictest::recAlert, fps_, kIV, kMV, store_, names_,
+                                         &ictest::recArrival, &kContext, &ictest::recLookup);
+    }
+    IC::Error loadFPs(std::set<std::string> skip = {})
+    {
+        for (auto const& r : fplibs_)
+            skip.insert(r.name);
+        toLoad_ = ictest::discover(tree_.fpDir(), skip);
+        return IC::FPControl().myloadFPs(counter_, fplibs_, fps_, store_, services_, toLoad_);
+    }
+    IC::Error reloadFPs()
+    {
+        return IC::FPControl().reLoadFPs(counter_, fplibs_, fps_, store_, services_, IC::AlertSink(&sink), names_);
     }
 
     ictest::TempTree tree_;
-    ictest::EnvGuard miEnv_{"IC_MI_DIR", tree_.miDir()};
+    ictest::EnvGuard miEnv_{"IC_MI_DIR", tree_.miDir()}, fpEnv_{"IC_FP_DIR", tree_.fpDir()};
     unsigned short counter_ = 7;
     std::vector<IC::libstruct> libs_, fplibs_, toLoad_;
     MIs mis_;
     std::vector<IC::FunctionalPlugIn*> fps_;
     std::set<std::string> names_;
     IC::NodeStore store_;
+    IC::InstrumentationControl facade_;
+    IC::ICforFP services_ = ictest::makeServices(mis_, &facade_);
 };
 
 // Of three, the second fails in Initialize: the others take consecutive
 // numbers and every callback in order; the failure is counted.
-TEST_F(MIControlTest, LoadsEachWithItsCallbacksInOrderAndCountsTheFailures)
+TEST_F(Loaders, LoadsEachWithItsCallbacksInOrderAndCountsTheFailures)
 {
     std::string const path = tree_.addMI("mi_alpha", "a1.so");
     tree_.addMI("mi_initfails", "a2.so");
@@ -105,11 +186,50 @@ TEST_F(MIControlTest, LoadsEachWithItsCallbacksInOrderAndCountsTheFailures)
     EXPECT_TRUE(libs_.empty());
 }
 
+// Of three, the second fails: the others take consecutive numbers and get
+// the services as given; the failed one is abandoned (closed, not
+// released). With FPs loaded, a failure is only counted.
+TEST_F(Loaders, LoadsEachWithTheNextNumberAndCountsTheFailures)
+{
+    tree_.addFP("fp_one", "a1.so");
+    tree_.addFP("fp_initfails", "a2.so");
+    std::string const path = tree_.addFP("fp_two", "a3.so");
+    ictest::LogCapture cap;
+    expectError(loadFPs(), 0, IC::Number(1u), "Count of FPs that did not load");
+    EXPECT_EQ(ictest::calls(cap, "fp_two"), (Strings{"fp_two:OpenFP", "fp_two:Initialize base=524288"}));
+    EXPECT_EQ(count(ictest::calls(cap), "fp_initfails:release"), 0u);
+    auto const &one = seen("fp_one"), &two = seen("fp_two");
+    EXPECT_TRUE(one.base == 7u << 16 && two.base == 8u << 16 && counter_ == 9);
+    ASSERT_TRUE(two.services);
+    ictest::expectServices(*two.services, mis_, &facade_);
+    EXPECT_TRUE(fps_.size() == 2u && fps_[0] == one.object && fps_[1] == two.object);
+    EXPECT_EQ(recs(toLoad_), (Strings{"a1.so 7", "a3.so 8"}));
+    EXPECT_EQ(recs(fplibs_), recs(toLoad_));
+    EXPECT_TRUE(fplibs_[1].handle == toLoad_[1].handle && fplibs_[1].path == path && fplibs_[1].plugin == two.object);
+    ictest::expectEvent(cap, {kLogFP, "FPControl"}, "myloadFPs: " + path + " Initialize Done", 3000, "myloadFPs");
+    ictest::fs::remove(tree_.fpDir() + "/a2.so");
+    tree_.addFP("fp_code");
+    expectError(loadFPs(), 0, IC::Number(1u), "Count of FPs that did not load");
+    EXPECT_TRUE(fps_.size() == 2u && counter_ == 9 && toLoad_.empty());
+
+    // Only a full path names a record to delete. A plug-in missing from the
+    // list still goes, and is reported.
+    cap.clear();
+    IC::FPControl().deleteFP(fplibs_, "a1.so", fps_);
+    IC::FPControl().deleteFP(fplibs_, tree_.fpDir() + "/a1.so", fps_);
+    fps_.clear();
+    IC::FPControl().deleteFP(fplibs_, path, fps_);
+    EXPECT_EQ(ictest::calls(cap), (Strings{"fp_one:release", "fp_one:image unloaded", "fp_two:release",
+                                           "fp_two:image unloaded"}));
+    EXPECT_EQ(cap.messages(kLogFP), (Strings{"deleteFP: FP not found in FP vector", "deleteFP: FP not found in FP vector"}));
+    EXPECT_TRUE(fplibs_.empty());
+}
+
 // One library that fails, each way it can: its line, the whole load failed,
 // no number used, the library closed, never released.
-TEST_F(MIControlTest, EveryWayToFailIsLoggedUnloadedAndCounted)
+TEST_F(Loaders, EveryWayToFailIsLoggedUnloadedAndCounted)
 {
-    std::string const thrown = std::string(" exploded Type=") + typeid(std::runtime_error).name() + " for {path}";
+    std::string const thrown = std::string(" exploded Type=") + typeid(std::runtime_error).name();
     struct Case {
         char const* module;
         std::string message; // {path} stands for the library's path
@@ -120,19 +240,28 @@ TEST_F(MIControlTest, EveryWayToFailIsLoggedUnloadedAndCounted)
                        {"mi_nullobject", "myloadMIs: {path} OpenMI pointer to MI is NULL"},
                        {"mi_initfails", "MI Initialize: " + err("mi init refused")},
                        {"mi_regfails", "MIControl MI registerForAlerts: " + err("mi alerts refused")},
-                       {"mi_throwopen", "myloadMIs: Exception open" + thrown},
-                       {"mi_throwinit", "myloadMIs: Exception init" + thrown},
-                       {"mi_throwint", "myloadMIs: {path} Exception loading library"}};
+                       {"mi_throwopen", "myloadMIs: Exception open" + thrown + " for {path}"},
+                       {"mi_throwinit", "myloadMIs: Exception init" + thrown + " for {path}"},
+                       {"mi_throwint", "myloadMIs: {path} Exception loading library"},
+                       {"fp_noentry", "myloadFPs: {path} OpenFP not found"},
+                       {"fp_code", "myloadFPs: {path} OpenFP failed, code=X"},
+                       {"fp_nullerror", "myloadFPs: {path} Pointer to Error is NULL"},
+                       {"fp_errstatus", "OpenFP(): " + err("fp refused")},
+                       {"fp_nullobject", "myloadFPs: {path} OpenFP pointer is NULL"},
+                       {"fp_initfails", "FP Initialize(): " + err("fp init refused")},
+                       {"fp_throwinit", "myloadFPs: Exception init" + thrown + " for {path}"},
+                       {"fp_throwint", "myloadFPs Caught exception for {path}"}};
     for (auto const& c : cases) {
         SCOPED_TRACE(c.module);
-        std::string const path = tree_.addMI(c.module);
+        bool const isMI = c.module[0] == 'm';
+        std::string const path = isMI ? tree_.addMI(c.module) : tree_.addFP(c.module);
         ictest::LogCapture cap;
-        expectError(load(), 1, IC::Number(1u), "No MIs were loaded");
+        expectError(isMI ? load() : loadFPs(), 1, IC::Number(1u), isMI ? "No MIs were loaded" : "No FPs were loaded");
         std::string message = c.message;
         if (message.find("{path}") != std::string::npos)
             message.replace(message.find("{path}"), 6, path);
-        EXPECT_EQ(cap.count(kLogMI, 6000, message), 1u) << message;
-        EXPECT_TRUE(counter_ == 7 && toLoad_.empty() && libs_.empty() && mis_.empty());
+        EXPECT_EQ(cap.count(isMI ? kLogMI : kLogFP, 6000, message), 1u) << message;
+        EXPECT_TRUE(counter_ == 7 && toLoad_.empty() && libs_.empty() && mis_.empty() && fplibs_.empty() && fps_.empty());
         EXPECT_FALSE(ictest::isMapped(path));
         EXPECT_EQ(count(ictest::calls(cap), std::string(c.module) + ":release"), 0u);
         ictest::fs::remove(path);
@@ -141,7 +270,7 @@ TEST_F(MIControlTest, EveryWayToFailIsLoggedUnloadedAndCounted)
 
 // A map that cannot be read leaves the interface loaded; known nodes pass
 // silently (status 6).
-TEST_F(MIControlTest, AnInterfaceWhoseMapCannotBeReadIsKept)
+TEST_F(Loaders, AnInterfaceWhoseMapCannotBeReadIsKept)
 {
     for (char const* m : {"mi_alpha", "mi_mapfails", "mi_mapthrows"})
         tree_.addMI(m);
@@ -156,26 +285,21 @@ TEST_F(MIControlTest, AnInterfaceWhoseMapCannotBeReadIsKept)
 
 // ---- reload ----
 
-class ReloadMIs : public MIControlTest {
+class ReloadMIs : public Loaders {
 protected:
     // alpha and beta loaded by a first reload, in name order, which tells
     // nobody; then fp_two.
     void SetUp() override
     {
-        MIControlTest::SetUp();
+        Loaders::SetUp();
         betaPath_ = tree_.addMI("mi_beta");
         alphaPath_ = tree_.addMI("mi_alpha");
         ASSERT_EQ(reload().getStatus(), 0);
         ASSERT_EQ(recs(libs_), (Strings{"mi_alpha.so 7", "mi_beta.so 8"}));
         tree_.addFP("fp_two");
+        services_ = ictest::makeServices(mis_, nullptr);
         loadFPs();
         ASSERT_TRUE(fps_.size() == 1u && ictest::Recorder::get().calls().empty());
-    }
-    void loadFPs(std::set<std::string> const& skip = {})
-    {
-        auto found = ictest::discover(tree_.fpDir(), skip);
-        IC::NodeStore unused;
-        IC::FPControl().myloadFPs(counter_, fplibs_, fps_, unused, ictest::makeServices(mis_, nullptr), found);
     }
     std::string alphaPath_, betaPath_;
 };
@@ -265,6 +389,37 @@ TEST_F(ReloadMIs, WhenNothingChangesOrNobodyIsLeftNobodyIsTold)
     EXPECT_EQ(count(c, "mi_alpha:release") + count(c, "mi_beta:release"), 2u);
     EXPECT_TRUE(mis_.empty() && libs_.empty() && ictest::calls(cap, "fp_two").empty());
     EXPECT_TRUE(ictest::Recorder::get().calls().empty());
+}
+
+// Loaded in name order; unchanged, nothing happens; removed, released;
+// renamed, loaded again with a new number. Additions that fail are counted,
+// or fail the reload when no FP is left.
+TEST_F(Loaders, AReloadFollowsTheDirectory)
+{
+    std::string const one = tree_.addFP("fp_one"), two = tree_.addFP("fp_two");
+    ictest::LogCapture cap;
+    expectError(reloadFPs(), 0);
+    EXPECT_EQ(recs(fplibs_), (Strings{"fp_one.so 7", "fp_two.so 8"}));
+    EXPECT_EQ(cap.count(kLogFP, 3000, " reloadFPs: Done adding FPs"), 1u);
+    cap.clear();
+    expectError(reloadFPs(), 0);
+    EXPECT_EQ(cap.messages(kLogFP), (Strings{" reLoadFPs:", " reloadFPs: Done - no additions"}));
+    ictest::fs::remove(two);
+    expectError(reloadFPs(), 0);
+    EXPECT_TRUE(count(ictest::calls(cap), "fp_two:release") == 1u && !ictest::isMapped(two));
+    ictest::fs::rename(one, tree_.fpDir() + "/fp_renamed.so");
+    expectError(reloadFPs(), 0);
+    EXPECT_EQ(count(ictest::calls(cap), "fp_one:release"), 1u);
+    EXPECT_EQ(seen("fp_one").base, 9u << 16);
+    EXPECT_EQ(recs(fplibs_), Strings{"fp_renamed.so 9"});
+    EXPECT_EQ(fps_.size(), 1u);
+    tree_.addFP("fp_code");
+    expectError(reloadFPs(), 0, IC::Number(1u), "Count of FPs that did not load");
+    ictest::fs::remove(tree_.fpDir() + "/fp_renamed.so");
+    ictest::fs::remove(tree_.fpDir() + "/fp_code.so");
+    tree_.addFP("fp_initfails");
+    expectError(reloadFPs(), 1, IC::Number(1u), "No FPs were loaded");
+    EXPECT_TRUE(fps_.empty() && fplibs_.empty());
 }
 
 } // namespace
