@@ -1,9 +1,7 @@
-// The common value types and the plug-in services object.
+// The common value types.
 #include <IC/Alert.h>
-#include <IC/ICforFP.h>
 #include <IC/Node.h>
 
-#include "Recorders.h"
 #include "TestSupport.h"
 
 namespace {
@@ -85,16 +83,6 @@ TEST(CommonTypes, NodesKeepTheirIdentityAndOrderedPropertiesAndCopyBoth)
         copy.setProperty("reading", std::to_string(i), "C");
     reader.join();
     EXPECT_EQ(bad.load(), 0);
-}
-
-TEST(CommonTypes, PlugInServicesKeepCopiesOfEveryValue)
-{
-    std::vector<IC::ManagementInterface*> mis{reinterpret_cast<IC::ManagementInterface*>(0x10)};
-    auto const given = mis;
-    auto* const facade = reinterpret_cast<IC::InstrumentationControl*>(0x30);
-    IC::ICforFP const services = ictest::makeServices(mis, facade);
-    mis.clear();
-    ictest::expectServices(IC::ICforFP(services), given, facade);
 }
 
 } // namespace

@@ -214,7 +214,7 @@ TEST(Stress, OpenUnloadCyclesWithAReenteringClientReturnToTheBaseline)
             paths.push_back(facade->getNodeUniqueId(n));
         // Ten interfaces of six nodes, ten functional plug-ins of two.
         exercise(paths, &mainTag, 80);
-        EXPECT_TRUE(ictest::eventually([&] { return findings.runs > before; })) << "no alert reached the client, cycle " << cycle;
+        ASSERT_TRUE(ictest::eventually([&] { return findings.runs > before; })) << "no alert reached the client, cycle " << cycle;
         fpAlertsSeen = fpAlertsSeen || fpReceived() > 0;
         Unloadlib(); // while the callbacks are busy
         ictest::forgetPlugins();
