@@ -1,13 +1,9 @@
 // The loader thread (IC::LoaderThread) on its own, and installed as the
 // library's periodic reloader: its part in the unload, and unloads that meet
 // a reload under way.
-#include <IC/InstCtrl.h>
-#include <IC/InstrumentationControl.h>
 #include <IC/LoaderThread.h>
 
-#include "PluginTest.h"
-
-#include <dlfcn.h>
+#include "PluginHarness.h"
 
 namespace {
 
@@ -16,15 +12,12 @@ using ictest::kLogLT;
 namespace IST = IC::InstCtrl;
 
 std::atomic<int> calls{0};
-void count()
-{
-    ++calls;
-}
+void count() { ++calls; }
 
 std::string const kZeroDelay = "LoaderThread has zero delay. Setting 10 seconds instead";
 
 // The delay is corrected when the thread runs, not before. A stop while it
-// waits ends it at once; stop() itself then sleeps a second.
+// waits ends it at once.
 TEST(LoaderThreadAlone, AZeroDelayBecomesTenSecondsAndAStopWhileWaitingEndsIt)
 {
     ictest::Watchdog dog(30, "loader thread");
@@ -35,54 +28,29 @@ TEST(LoaderThreadAlone, AZeroDelayBecomesTenSecondsAndAStopWhileWaitingEndsIt)
     ASSERT_TRUE(t.start());
     EXPECT_TRUE(ictest::eventually([&] { return cap.count(kLogLT, 6000, kZeroDelay) == 1; }));
     EXPECT_TRUE(t.getDelay() == 10u && !t.stopped());
-    std::this_thread::sleep_for(std::chrono::milliseconds(200));
-    EXPECT_EQ(calls.load(), 0) << "called before its period";
-    auto const before = std::chrono::steady_clock::now();
     t.stop();
-    EXPECT_GE(std::chrono::steady_clock::now() - before, std::chrono::milliseconds(950));
     EXPECT_TRUE(t.join() && t.stopped() && calls.load() == 0);
-    ASSERT_EQ(cap.logs(kLogLT).size(), 1u);
     ictest::expectEvent(cap, {kLogLT, "LoaderThread"}, kZeroDelay, 6000, "run");
 }
 
-// Without a function it only waits. With the stop request already there, a
-// run only corrects the delay and ends, and the next one does not even do
-// that; an exception from the function ends run().
+// It calls its function every period until stopped; a stopped object never
+// calls; an exception from the function ends run().
 TEST(LoaderThreadAlone, CallsItsFunctionEveryPeriodUntilStopped)
 {
     ictest::Watchdog dog(30, "loader thread");
     calls = 0;
-    ictest::LogCapture cap;
-    IC::LoaderThread t(0, 1, &count), idle(0, 1, nullptr);
-    ASSERT_TRUE(t.start() && idle.start());
+    IC::LoaderThread t(0, 1, &count);
+    ASSERT_TRUE(t.start());
     EXPECT_TRUE(ictest::eventually([] { return calls.load() >= 2; }, 8000));
-    EXPECT_FALSE(t.stopped() || idle.stopped());
     t.stop();
-    idle.stop();
-    EXPECT_TRUE(t.join() && idle.join() && t.stopped() && idle.stopped());
+    EXPECT_TRUE(t.join() && t.stopped());
     int const seen = calls.load();
-    EXPECT_TRUE(cap.logs(kLogLT).empty());
-
     IC::LoaderThread stopped(1, 0, &count);
     stopped.stop();
     EXPECT_EQ(stopped.run(nullptr), nullptr);
-    EXPECT_EQ(stopped.run(nullptr), nullptr);
-    EXPECT_EQ(cap.messages(kLogLT), std::vector<std::string>{kZeroDelay});
-    EXPECT_EQ(calls.load(), seen) << "a stopped object never calls";
+    EXPECT_EQ(calls.load(), seen);
     IC::LoaderThread failing(0, 1, [] { throw std::runtime_error("reload broke"); });
-    EXPECT_THROW(failing.run(nullptr), std::runtime_error);
-    EXPECT_FALSE(failing.stopped()) << "run() did not get to its end";
-}
-
-// A host may derive its own loader thread from the class (or catch and cast
-// it): the type's run-time information is part of the library's interface.
-TEST(LoaderThreadExport, ItsTypeInformationIsExported)
-{
-    void* lib = dlopen(IC_LIBRARY_PATH, RTLD_NOW | RTLD_LOCAL);
-    ASSERT_NE(lib, nullptr) << dlerror();
-    EXPECT_NE(dlsym(lib, "_ZTIN2IC12LoaderThreadE"), nullptr) << "typeinfo for IC::LoaderThread";
-    EXPECT_NE(dlsym(lib, "_ZTVN2IC12LoaderThreadE"), nullptr) << "vtable for IC::LoaderThread";
-    dlclose(lib);
+    EXPECT_THROW(failing.run(nullptr), std::runtime_error) << "an exception from the function ends run()";
 }
 
 // ---- installed in the library ----
@@ -95,20 +63,19 @@ protected:
         tree_.addMI("mi_alpha");
     }
     // Opens and installs a loader thread, as a host does.
-    static IC::LoaderThread* openWithLoader(unsigned long delay)
+    static void openWithLoader(unsigned long delay)
     {
         IC::InstrumentationControl* c = nullptr;
         IC::Error* e = nullptr;
         EXPECT_EQ(Open(&c, &e), 0);
         IST::lt = new IC::LoaderThread(0, delay, &IST::TimedReload);
         EXPECT_TRUE(IST::lt->start());
-        return IST::lt;
     }
     // The last unload ended everything, the thread first.
-    static void expectAllGone()
+    void expectAllGone()
     {
         EXPECT_TRUE(IST::ICloadCount == 0u && IST::unloaddone && IST::lt == nullptr);
-        EXPECT_EQ(ictestprobe::liveImages(), 0);
+        EXPECT_FALSE(ictest::isMapped(tree_.root()));
     }
     ictest::Watchdog dog_{60, "installed loader thread"};
 };
@@ -125,27 +92,30 @@ TEST_F(InstalledLoader, OnlyTheLastUnloadStopsJoinsAndDeletesItBeforeAnyPlugIn)
     ictest::LogCapture cap;
     Unloadlib(); // deletes it (the address checker reports it otherwise)
     expectAllGone();
-    ictest::expectInOrder(ictest::timeline(cap), {"doUnload: waiting for LoaderThread Termination ",
-                                                  "doUnload: LoaderThread ended ", "mi_alpha:release"});
-    ictest::expectEvent(cap, {kLogIC, "InstrumentationControl"}, "doUnload: LoaderThread ended ", 3000, "doUnload");
+    auto const& m = cap.messages();
+    auto const at = [&m](std::string const& s) { return std::find(m.begin(), m.end(), s) - m.begin(); };
+    EXPECT_LT(at("doUnload: LoaderThread ended "), at("mi_alpha:release"));
 }
 
 // The thread's reload is inside the new plug-in's Initialize, with the load
 // lock held: the load under way completes before the teardown.
 TEST_F(InstalledLoader, AnUnloadDuringASlowReloadWaitsForItAndFinishes)
 {
+    ictest::LogCapture cap;
     openWithLoader(1);
     tree_.addMI("mi_slow");
-    ASSERT_TRUE(ictest::eventually(
-        [] { return !ictestprobe::eventsWithPrefix("mi_slow:Initialize base=").empty(); }, 10000));
+    ASSERT_TRUE(ictest::eventually([&] { return ictest::calls(cap, "mi_slow").size() >= 3; }, 10000));
     Unloadlib();
     expectAllGone();
-    ictest::expectInOrder(ictestprobe::events(), {"mi_slow:Initialize slept", "mi_slow:shutdown", "mi_slow:release"});
+    auto const c = ictest::calls(cap, "mi_slow");
+    auto const at = [&c](char const* s) { return std::find(c.begin(), c.end(), std::string(s)) - c.begin(); };
+    EXPECT_TRUE(at("mi_slow:Initialize slept") < at("mi_slow:shutdown") && at("mi_slow:shutdown") < at("mi_slow:release") &&
+                at("mi_slow:release") < static_cast<long>(c.size()));
 }
 
-// The loader thread has woken up and waits for the load lock inside a timed
-// reload while the last unload takes that lock: the unload must still end.
-// Who gets the lock first is up to the scheduler, so the round is repeated.
+// The loader thread waits for the load lock inside a timed reload while the
+// last unload takes that lock: the unload must still end. Who gets the lock
+// first is up to the scheduler, so the round is repeated.
 TEST_F(InstalledLoader, AnUnloadWhileTheReloadWaitsForTheLockDoesNotDeadlock)
 {
     for (int round = 0; round < 3; ++round) {
@@ -155,8 +125,7 @@ TEST_F(InstalledLoader, AnUnloadWhileTheReloadWaitsForTheLockDoesNotDeadlock)
         EXPECT_TRUE(ictest::eventually(
             [&] { return cap.count(kLogIC, 3000, "Instrumentation Control Timed Reload") >= 1; }));
         ictest::JoinedThread unloader([] { Unloadlib(); });
-        // Let the unload queue up for the lock as well.
-        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+        std::this_thread::sleep_for(std::chrono::milliseconds(200)); // the unload queues up too
         IST::loadlock.unlock();
         unloader.join();
         expectAllGone();
