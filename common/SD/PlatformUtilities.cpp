@@ -223,14 +223,25 @@ bool fileTrusted(std::string const& file, struct stat const& st, std::string& re
 // The chain from "/" to the file as it was walked: every component opened
 // relative to the one before without following links, so that what is
 // judged is exactly the chain that leads to the file.
+struct Chain {
+    std::vector<std::string> paths; // "/", then each directory reached
+    std::vector<struct stat> stats;
+};
+
 struct Walk {
-    std::vector<std::string> paths; // "/", each directory, then the file
-    std::vector<struct stat> stats; // as many as components were reached
-    Descriptor ownDir;              // the file's directory (O_PATH), unless a scan holds it
-    int dir = -1;                   // the file's directory, whoever holds it
-    std::size_t dirs = 0;           // how many of paths and stats are directories
-    std::string name;               // the file's name in it
-    bool complete = false;          // every component reached, the file regular
+    Walk() = default;
+    Walk(Walk const&) = delete; // dirs may point into the walk itself
+    Walk& operator=(Walk const&) = delete;
+
+    Chain own;                // the directories, when walked here
+    Chain const* dirs = &own; // the directories judged: own, or a scan's
+    Descriptor ownDir;        // the file's directory (O_PATH), unless a scan holds it
+    int dir = -1;             // the file's directory, whoever holds it
+    std::string name;         // the file's name in it
+    std::string file;         // its path, once its status was taken
+    struct stat fileStat {};
+    bool reached = false;     // the file's status was taken
+    bool complete = false;    // and it is a regular file
 };
 
 // Splits an absolute path into its names; false when one of them is "." or
@@ -253,17 +264,15 @@ bool splitNames(std::string const& path, std::vector<std::string>& names)
 // Takes the status of the file in the walked directory, without opening it.
 bool finishWalk(Walk& walk, std::string const& name, std::string& reason)
 {
-    std::string path = childPath(walk.paths.back(), name);
-    struct stat st {};
-    if (::fstatat(walk.dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-        reason = path + ": " + errorText(errno);
+    walk.file = childPath(walk.dirs->paths.back(), name);
+    if (::fstatat(walk.dir, name.c_str(), &walk.fileStat, AT_SYMLINK_NOFOLLOW) != 0) {
+        reason = walk.file + ": " + errorText(errno);
         return false;
     }
-    walk.paths.push_back(std::move(path));
-    walk.stats.push_back(st);
+    walk.reached = true;
     // Opening a FIFO would block, and a directory or device is never a
     // library.
-    if (!S_ISREG(st.st_mode)) {
+    if (!S_ISREG(walk.fileStat.st_mode)) {
         reason = "not a regular file";
         return false;
     }
@@ -291,12 +300,13 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
         reason = "/: " + errorText(errno);
         return false;
     }
-    walk.paths.reserve(names.size() + 1);
-    walk.stats.reserve(names.size() + 1);
-    walk.paths.emplace_back("/");
-    walk.stats.push_back(st);
+    Chain& chain = walk.own;
+    chain.paths.reserve(names.size());
+    chain.stats.reserve(names.size());
+    chain.paths.emplace_back("/");
+    chain.stats.push_back(st);
     for (std::size_t i = 0; i + 1 < names.size(); ++i) {
-        std::string path = childPath(walk.paths.back(), names[i]);
+        std::string path = childPath(chain.paths.back(), names[i]);
         Descriptor next(::openat(dir.get(), names[i].c_str(),
                                  O_PATH | O_NOFOLLOW | O_DIRECTORY | O_CLOEXEC));
         if (!next.valid() || ::fstat(next.get(), &st) != 0) {
@@ -305,13 +315,12 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
             reason = path + ": " + errorText(errno);
             return false;
         }
-        walk.paths.push_back(std::move(path));
-        walk.stats.push_back(st);
+        chain.paths.push_back(std::move(path));
+        chain.stats.push_back(st);
         dir = std::move(next);
     }
     walk.ownDir = std::move(dir);
     walk.dir = walk.ownDir.get();
-    walk.dirs = walk.stats.size();
     return finishWalk(walk, names.back(), reason);
 }
 
@@ -319,10 +328,14 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
 // below it, then the file itself.
 bool chainTrusted(Walk const& walk, std::string& reason)
 {
-    for (std::size_t i = 1; i < walk.stats.size(); ++i)
-        if (!directoryTrusted(walk.paths[i - 1], walk.stats[i - 1], walk.paths[i], walk.stats[i], reason))
+    Chain const& chain = *walk.dirs;
+    for (std::size_t i = 1; i < chain.stats.size(); ++i)
+        if (!directoryTrusted(chain.paths[i - 1], chain.stats[i - 1], chain.paths[i], chain.stats[i], reason))
             return false;
-    return !walk.complete || fileTrusted(walk.paths.back(), walk.stats.back(), reason);
+    if (!walk.reached)
+        return true;
+    return directoryTrusted(chain.paths.back(), chain.stats.back(), walk.file, walk.fileStat, reason) &&
+           (!walk.complete || fileTrusted(walk.file, walk.fileStat, reason));
 }
 
 // Replaces each occurrence of name that ends where a name ends in the
@@ -420,15 +433,15 @@ bool nameHeld(std::string const& name)
 
 // Loads the judged file by its path, under which the loader, debuggers and
 // $ORIGIN then know it, and keeps it only when the object the loader mapped
-// is the judged inode. An object the loader already held under that name,
-// mapped from a file since replaced, is not the judged one: the name is then
-// spelled anew ("dir/./name") so that the loader opens the file. On return
-// name is the name the loader knows the library by.
+// is the judged inode. An object that stays mapped under that name after the
+// close of a mismatch is one the loader held before (from a file since
+// replaced), not a file swapped in now: the name is then spelled anew
+// ("dir/./name") so that the loader opens the file. On return name is the
+// name the loader knows the library by.
 void* loadJudged(std::string& name, struct stat const& st, int maps, bool enforce, std::string& reason)
 {
     constexpr int kAttempts = 8;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
-        bool const held = nameHeld(name);
         dlerror();
         // RTLD_NOW: an unresolved symbol shows now, before any of the
         // library's constructors run, not as a crash at first call.
@@ -447,7 +460,8 @@ void* loadJudged(std::string& name, struct stat const& st, int maps, bool enforc
             reason = "cannot tell which file the loader mapped (no /proc/self/maps)";
             return nullptr;
         }
-        if (!held) {
+        // Still held after this close: an object that stays mapped.
+        if (!nameHeld(name)) {
             reason = "the file changed while it was being loaded";
             return nullptr;
         }
@@ -463,8 +477,7 @@ void* loadJudged(std::string& name, struct stat const& st, int maps, bool enforc
 // it saw, and that directory's descriptor.
 struct PlatformUtilities::Scan::State {
     std::string directory; // as the caller spelled it
-    std::vector<std::string> paths;
-    std::vector<struct stat> stats;
+    Chain chain;
     Descriptor dir;
     Descriptor maps; // /proc/self/maps, asked which file each library came from
 };
@@ -485,18 +498,15 @@ bool walkInScan(PlatformUtilities::Scan::State* scan, std::string const& file, W
         std::string const name = file.substr(slash + 1);
         if (name.empty() || name == "." || name == "..")
             return false;
-        walk.paths = scan->paths;
-        walk.stats = scan->stats;
+        walk.dirs = &scan->chain;
         walk.dir = scan->dir.get();
-        walk.dirs = walk.stats.size();
         return finishWalk(walk, name, reason);
     }
     bool const walked = walkPath(file, walk, reason);
     if (scan != nullptr && walk.ownDir.valid()) {
         scan->directory = file.substr(0, slash);
-        auto const dirs = static_cast<std::ptrdiff_t>(walk.dirs);
-        scan->paths.assign(walk.paths.begin(), walk.paths.begin() + dirs);
-        scan->stats.assign(walk.stats.begin(), walk.stats.begin() + dirs);
+        scan->chain = std::move(walk.own);
+        walk.dirs = &scan->chain;
         scan->dir = std::move(walk.ownDir);
     }
     return walked;
@@ -546,43 +556,40 @@ _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
     // A path without links is walked as given. Otherwise links are resolved
     // first; what is checked, and loaded, is the file they lead to, along
     // the directories that hold it.
-    Walk walk;
-    std::string resolved = path;
-    if (path[0] != '/' || resolved.back() == '/' ||
-        !walkInScan(currentScan != nullptr ? currentScan->state_ : nullptr, resolved, walk, reason)) {
+    PlatformUtilities::Scan::State* const scan = currentScan != nullptr ? currentScan->state_ : nullptr;
+    Walk asGiven, asResolved;
+    Walk* walk = &asGiven;
+    std::size_t const length = std::strlen(path);
+    if (path[0] != '/' || path[length - 1] == '/' || !walkInScan(scan, path, asGiven, reason)) {
         std::unique_ptr<char, decltype(&std::free)> const real(realpath(path, nullptr), &std::free);
         if (!real) {
             int const error = errno;
             SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", errorText(error));
             return nullptr;
         }
-        resolved = real.get();
-        walk = Walk();
-        walkPath(resolved, walk, reason);
+        walk = &asResolved;
+        walkPath(real.get(), asResolved, reason);
     }
     // A refusal on the way is reported before whatever stopped the walk.
-    if ((enforce && !chainTrusted(walk, reason)) || !walk.complete) {
+    if ((enforce && !chainTrusted(*walk, reason)) || !walk->complete) {
         SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", reason);
         return nullptr;
     }
-    resolved = walk.paths.back();
     if (!enforce)
         SD_LOG(LEVEL_WARNING, "Plug-in trust checks are off (", kTrustVariable, "=off): loading ", path,
                " without checking its owners and permissions");
-
-    walk.ownDir.reset();
+    walk->ownDir.reset();
 
     // Every directory down to the file was just found writable by root or
     // the effective user only: nobody else can replace the file before the
     // loader opens it. What the loader mapped is compared with what was
     // judged all the same.
-    PlatformUtilities::Scan::State* const scan = currentScan != nullptr ? currentScan->state_ : nullptr;
     Descriptor ownMaps;
     if (scan == nullptr || !scan->maps.valid())
         ownMaps.reset(::open("/proc/self/maps", O_RDONLY | O_CLOEXEC));
     int const maps = ownMaps.valid() || scan == nullptr ? ownMaps.get() : scan->maps.get();
-    std::string loadedAs = resolved;
-    void* const library = loadJudged(loadedAs, walk.stats.back(), maps, enforce, reason);
+    std::string loadedAs = walk->file;
+    void* const library = loadJudged(loadedAs, walk->fileStat, maps, enforce, reason);
     if (scan != nullptr && ownMaps.valid())
         scan->maps = std::move(ownMaps);
     if (library == nullptr) {
