@@ -21,6 +21,16 @@ packages=(
 optional=(chromium chromium-driver)
 
 installed() { dpkg-query -W -f='${Status}' "$1" 2>/dev/null | grep -q 'install ok installed'; }
+
+sudo=""
+[[ $(id -u) -ne 0 ]] && sudo="sudo"
+# --i386: also what the 32-bit x86 form needs (scripts/test.sh --i386): the
+# compiler's 32-bit libraries and the i386 builds of the libraries linked.
+if [[ "${1:-}" == "--i386" ]]; then
+  dpkg --print-foreign-architectures | grep -qx i386 || $sudo dpkg --add-architecture i386
+  packages+=(g++-multilib liblog4cxx-dev:i386 libgtest-dev:i386 libgmock-dev:i386 libssl-dev:i386 libcrypt-dev:i386)
+fi
+
 missing=()
 for p in "${packages[@]}" "${optional[@]}"; do
   installed "$p" || missing+=("$p")
@@ -28,8 +38,6 @@ done
 have_promtool() { command -v promtool >/dev/null || [[ -x build/deps/usr/bin/promtool ]]; }
 
 if [[ ${#missing[@]} -gt 0 || "${CI:-}" == "true" ]] || ! have_promtool; then
-  sudo=""
-  [[ $(id -u) -ne 0 ]] && sudo="sudo"
   export DEBIAN_FRONTEND=noninteractive
   $sudo apt-get update -qq
   $sudo apt-get install -y -qq --no-install-recommends "${packages[@]}"

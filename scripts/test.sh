@@ -8,22 +8,25 @@
 #   scripts/test.sh --tsan     normal + ASan/UBSan + TSan
 #   scripts/test.sh --quick    normal build only
 #   scripts/test.sh --soak     also the long open/unload soak (10,000 cycles)
+#   scripts/test.sh --i386     also the 32-bit x86 form (-m32, cmake/i386-linux-gnu.cmake)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 quick=0
 soak=0
+i386=0
 tsan=${IC_TSAN:-0}
 for arg in "$@"; do
   case "$arg" in
     --quick) quick=1 ;;
     --tsan) tsan=1 ;;
     --soak) soak=1 ;;
-    *) echo "usage: $0 [--quick] [--tsan] [--soak]" >&2; exit 2 ;;
+    --i386) i386=1 ;;
+    *) echo "usage: $0 [--quick] [--tsan] [--soak] [--i386]" >&2; exit 2 ;;
   esac
 done
 
-scripts/install-deps.sh
+if [[ $i386 -eq 1 ]]; then scripts/install-deps.sh --i386; else scripts/install-deps.sh; fi
 
 jobs=$(nproc 2>/dev/null || echo 2)
 
@@ -56,4 +59,10 @@ if [[ $tsan -eq 1 ]]; then
   # The installed-package test only rebuilds the consumer; it says nothing
   # about threads.
   build_and_test tsan -LE 'package|soak-long' -- -DIC_SANITIZE=thread
+fi
+
+if [[ $i386 -eq 1 ]]; then
+  # The installed-package test configures its client without the toolchain
+  # file, as a 64-bit build.
+  build_and_test i386 -LE 'package|soak-long' -- --toolchain cmake/i386-linux-gnu.cmake
 fi

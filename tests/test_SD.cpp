@@ -95,19 +95,21 @@ TEST(SDEvent, ManualResetStaysSignalledAndAutoResetIsConsumedByOneWait)
     // A signal from another thread ends every kind of wait before its limit.
     // Limits whose deadline the clock cannot express must still wait, not
     // overflow into a deadline in the past and time out at once.
+    // Limits beyond a 32-bit unsigned long are cut to its largest value there.
     struct Case {
         bool manual, seconds;
-        unsigned long limit;
-    } const cases[] = {{false, true, NO_LIMIT},   {true, false, NO_LIMIT},       {true, false, GENEROUS_MS},
-                       {false, true, ULONG_MAX},  {false, true, 9000000000UL},   {false, true, 0xFFFFFFFEUL},
-                       {false, false, ULONG_MAX}, {false, false, ULONG_MAX / 2}, {false, false, 0x100000000UL}};
+        unsigned long long limit;
+    } const cases[] = {{false, true, NO_LIMIT},   {true, false, NO_LIMIT},        {true, false, GENEROUS_MS},
+                       {false, true, ULONG_MAX},  {false, true, 9000000000ULL},   {false, true, 0xFFFFFFFEUL},
+                       {false, false, ULONG_MAX}, {false, false, ULONG_MAX / 2}, {false, false, 0x100000000ULL}};
     for (auto const& c : cases) {
         SD::Event e(c.manual);
         JoinedThread signaller([&] {
             SD::Thread::sleepMilliseconds(20);
             e.signal();
         });
-        EXPECT_EQ(c.seconds ? e.wait(c.limit) : e.waitMilliseconds(c.limit), 0) << c.limit << " " << c.seconds;
+        auto const limit = static_cast<unsigned long>(std::min<unsigned long long>(c.limit, ULONG_MAX));
+        EXPECT_EQ(c.seconds ? e.wait(limit) : e.waitMilliseconds(limit), 0) << c.limit << " " << c.seconds;
         signaller.join();
         EXPECT_EQ(e.test(), c.manual);
     }

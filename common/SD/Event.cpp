@@ -21,7 +21,8 @@ bool deadlineAfter(unsigned long count, Clock::duration unit, Clock::time_point&
         return false;
     Clock::time_point const now = Clock::now();
     Clock::rep const room = (Clock::time_point::max() - now) / unit;
-    if (room <= 0 || count >= static_cast<unsigned long>(room))
+    // Compared in the wider type: on 32-bit targets room exceeds any count.
+    if (room <= 0 || static_cast<unsigned long long>(count) >= static_cast<unsigned long long>(room))
         return false;
     deadline = now + unit * static_cast<Clock::rep>(count);
     return true;

@@ -19,6 +19,7 @@
 #include <fcntl.h>
 #include <link.h>
 #include <strings.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
@@ -38,10 +39,6 @@ struct _LibraryHandle {
     std::string path;
     // The name the loader knows the library by, which its messages use.
     std::string loadedAs;
-    // The descriptor the library was checked and loaded through. Kept open
-    // while the library is, so that no other library is loaded under the same
-    // /proc/self/fd name while this one holds it.
-    int descriptor;
 };
 
 namespace {
@@ -226,14 +223,25 @@ bool fileTrusted(std::string const& file, struct stat const& st, std::string& re
 // The chain from "/" to the file as it was walked: every component opened
 // relative to the one before without following links, so that what is
 // judged is exactly the chain that leads to the file.
+struct Chain {
+    std::vector<std::string> paths; // "/", then each directory reached
+    std::vector<struct stat> stats;
+};
+
 struct Walk {
-    std::vector<std::string> paths; // "/", each directory, then the file
-    std::vector<struct stat> stats; // as many as components were reached
-    Descriptor ownDir;              // the file's directory (O_PATH), unless a scan holds it
-    int dir = -1;                   // the file's directory, whoever holds it
-    std::size_t dirs = 0;           // how many of paths and stats are directories
-    std::string name;               // the file's name in it
-    bool complete = false;          // every component reached, the file regular
+    Walk() = default;
+    Walk(Walk const&) = delete; // dirs may point into the walk itself
+    Walk& operator=(Walk const&) = delete;
+
+    Chain own;                // the directories, when walked here
+    Chain const* dirs = &own; // the directories judged: own, or a scan's
+    Descriptor ownDir;        // the file's directory (O_PATH), unless a scan holds it
+    int dir = -1;             // the file's directory, whoever holds it
+    std::string name;         // the file's name in it
+    std::string file;         // its path, once its status was taken
+    struct stat fileStat {};
+    bool reached = false;     // the file's status was taken
+    bool complete = false;    // and it is a regular file
 };
 
 // Splits an absolute path into its names; false when one of them is "." or
@@ -256,17 +264,15 @@ bool splitNames(std::string const& path, std::vector<std::string>& names)
 // Takes the status of the file in the walked directory, without opening it.
 bool finishWalk(Walk& walk, std::string const& name, std::string& reason)
 {
-    std::string path = childPath(walk.paths.back(), name);
-    struct stat st {};
-    if (::fstatat(walk.dir, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) {
-        reason = path + ": " + errorText(errno);
+    walk.file = childPath(walk.dirs->paths.back(), name);
+    if (::fstatat(walk.dir, name.c_str(), &walk.fileStat, AT_SYMLINK_NOFOLLOW) != 0) {
+        reason = walk.file + ": " + errorText(errno);
         return false;
     }
-    walk.paths.push_back(std::move(path));
-    walk.stats.push_back(st);
+    walk.reached = true;
     // Opening a FIFO would block, and a directory or device is never a
     // library.
-    if (!S_ISREG(st.st_mode)) {
+    if (!S_ISREG(walk.fileStat.st_mode)) {
         reason = "not a regular file";
         return false;
     }
@@ -294,12 +300,13 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
         reason = "/: " + errorText(errno);
         return false;
     }
-    walk.paths.reserve(names.size() + 1);
-    walk.stats.reserve(names.size() + 1);
-    walk.paths.emplace_back("/");
-    walk.stats.push_back(st);
+    Chain& chain = walk.own;
+    chain.paths.reserve(names.size());
+    chain.stats.reserve(names.size());
+    chain.paths.emplace_back("/");
+    chain.stats.push_back(st);
     for (std::size_t i = 0; i + 1 < names.size(); ++i) {
-        std::string path = childPath(walk.paths.back(), names[i]);
+        std::string path = childPath(chain.paths.back(), names[i]);
         Descriptor next(::openat(dir.get(), names[i].c_str(),
                                  O_PATH | O_NOFOLLOW | O_DIRECTORY | O_CLOEXEC));
         if (!next.valid() || ::fstat(next.get(), &st) != 0) {
@@ -308,13 +315,12 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
             reason = path + ": " + errorText(errno);
             return false;
         }
-        walk.paths.push_back(std::move(path));
-        walk.stats.push_back(st);
+        chain.paths.push_back(std::move(path));
+        chain.stats.push_back(st);
         dir = std::move(next);
     }
     walk.ownDir = std::move(dir);
     walk.dir = walk.ownDir.get();
-    walk.dirs = walk.stats.size();
     return finishWalk(walk, names.back(), reason);
 }
 
@@ -322,33 +328,14 @@ bool walkPath(std::string const& file, Walk& walk, std::string& reason)
 // below it, then the file itself.
 bool chainTrusted(Walk const& walk, std::string& reason)
 {
-    for (std::size_t i = 1; i < walk.stats.size(); ++i)
-        if (!directoryTrusted(walk.paths[i - 1], walk.stats[i - 1], walk.paths[i], walk.stats[i], reason))
+    Chain const& chain = *walk.dirs;
+    for (std::size_t i = 1; i < chain.stats.size(); ++i)
+        if (!directoryTrusted(chain.paths[i - 1], chain.stats[i - 1], chain.paths[i], chain.stats[i], reason))
             return false;
-    return !walk.complete || fileTrusted(walk.paths.back(), walk.stats.back(), reason);
-}
-
-// Opens the judged file for reading through its directory's descriptor and
-// makes sure it is still the file that was judged; reason is set only when
-// it is not. A file that cannot be read is left to the loader to report.
-Descriptor openJudged(Walk const& walk, std::string& reason)
-{
-    Descriptor fd(::openat(walk.dir, walk.name.c_str(),
-                           O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
-    struct stat st {};
-    if (!fd.valid() || ::fstat(fd.get(), &st) != 0)
-        return Descriptor();
-    struct stat const& judged = walk.stats.back();
-    if (st.st_dev != judged.st_dev || st.st_ino != judged.st_ino) {
-        reason = "the file changed while it was being loaded";
-        return Descriptor();
-    }
-    return fd;
-}
-
-std::string descriptorName(int fd)
-{
-    return "/proc/self/fd/" + std::to_string(fd);
+    if (!walk.reached)
+        return true;
+    return directoryTrusted(chain.paths.back(), chain.stats.back(), walk.file, walk.fileStat, reason) &&
+           (!walk.complete || fileTrusted(walk.file, walk.fileStat, reason));
 }
 
 // Replaces each occurrence of name that ends where a name ends in the
@@ -371,15 +358,22 @@ std::string renamed(std::string text, std::string const& name, std::string const
     return text;
 }
 
-// Whether the object behind a loader handle was mapped from the file st
-// describes: the mapping that holds its dynamic section names the device and
-// inode.
-bool mappedFrom(void* library, struct stat const& st)
+// The kernel's answer, by address, to which file backs a mapping (Linux
+// 6.11 and later; the system headers may predate it).
+struct MappingQuery {
+    std::uint64_t size, flags, address, start, end, vmaFlags, pageSize, offset, inode;
+    std::uint32_t devMajor, devMinor, nameSize, buildIdSize;
+    std::uint64_t nameAddress, buildIdAddress;
+};
+static_assert(sizeof(MappingQuery) == 104, "the kernel's struct procmap_query");
+constexpr unsigned long kProcmapQuery = _IOWR('f', 17, MappingQuery);
+
+enum class Mapped { fromFile, fromOther, unknown };
+
+// The same question answered from the text of /proc/self/maps, for kernels
+// without the query.
+Mapped mappedFromText(std::uintptr_t address, struct stat const& st)
 {
-    struct link_map* map = nullptr;
-    if (dlinfo(library, RTLD_DI_LINKMAP, &map) != 0 || map == nullptr || map->l_ld == nullptr)
-        return false;
-    auto const address = reinterpret_cast<std::uintptr_t>(map->l_ld);
     std::ifstream maps("/proc/self/maps");
     std::string line;
     while (std::getline(maps, line)) {
@@ -387,119 +381,31 @@ bool mappedFrom(void* library, struct stat const& st)
         unsigned int major = 0, minor = 0;
         char perms[8] = {};
         if (std::sscanf(line.c_str(), "%llx-%llx %7s %llx %x:%x %llu", &start, &end, perms, &offset,
-                        &major, &minor, &inode) != 7)
-            continue;
-        if (address < start || address >= end)
-            continue;
-        return makedev(major, minor) == st.st_dev && inode == st.st_ino;
+                        &major, &minor, &inode) == 7 &&
+            address >= start && address < end)
+            return makedev(major, minor) == st.st_dev && inode == st.st_ino ? Mapped::fromFile
+                                                                              : Mapped::fromOther;
     }
-    return false;
+    return Mapped::unknown;
 }
 
-// Reads exactly size bytes at offset.
-bool readAt(int fd, void* buffer, std::size_t size, std::uint64_t offset)
+// Whether the object behind a loader handle was mapped from the file st
+// describes: the mapping that holds its dynamic section names the device and
+// inode. maps is an open /proc/self/maps, or invalid when there is none.
+Mapped mappedFrom(void* library, struct stat const& st, int maps)
 {
-    auto* bytes = static_cast<char*>(buffer);
-    while (size > 0) {
-        ssize_t const n = ::pread(fd, bytes, size, static_cast<off_t>(offset));
-        if (n < 0 && errno == EINTR)
-            continue;
-        if (n <= 0)
-            return false;
-        bytes += n;
-        size -= static_cast<std::size_t>(n);
-        offset += static_cast<std::uint64_t>(n);
-    }
-    return true;
-}
-
-// Whether the library's run paths or dependencies use $ORIGIN, which the
-// loader works out from the name it was given: through /proc/self/fd it
-// would point into /proc. Anything it cannot read counts as no, and the
-// loader then reports the file itself. The first block read usually holds
-// the headers and, in a small library, the string table too.
-bool usesOrigin(int fd)
-{
-    char head[4096];
-    ssize_t got = 0;
-    do
-        got = ::pread(fd, head, sizeof head, 0);
-    while (got < 0 && errno == EINTR);
-    if (got < static_cast<ssize_t>(sizeof(ElfW(Ehdr))))
-        return false;
-    auto const headSize = static_cast<std::uint64_t>(got);
-    // Copies size bytes at offset, from the block already read when it holds
-    // them.
-    auto const fetch = [&](void* buffer, std::size_t size, std::uint64_t offset) {
-        if (offset <= headSize && size <= headSize - offset) {
-            std::memcpy(buffer, head + offset, size);
-            return true;
-        }
-        return readAt(fd, buffer, size, offset);
-    };
-
-    ElfW(Ehdr) header;
-    std::memcpy(&header, head, sizeof header);
-    if (std::memcmp(header.e_ident, ELFMAG, SELFMAG) != 0 ||
-        header.e_ident[EI_CLASS] != (__ELF_NATIVE_CLASS == 64 ? ELFCLASS64 : ELFCLASS32) ||
-        header.e_phentsize != sizeof(ElfW(Phdr)) || header.e_phnum == 0)
-        return false;
-    std::vector<ElfW(Phdr)> segments(header.e_phnum);
-    if (!fetch(segments.data(), segments.size() * sizeof(ElfW(Phdr)), header.e_phoff))
-        return false;
-    ElfW(Phdr) const* dynamic = nullptr;
-    for (auto const& segment : segments)
-        if (segment.p_type == PT_DYNAMIC)
-            dynamic = &segment;
-    constexpr std::size_t kMaxEntries = 4096;
-    if (dynamic == nullptr || dynamic->p_filesz == 0 ||
-        dynamic->p_filesz / sizeof(ElfW(Dyn)) > kMaxEntries)
-        return false;
-    std::vector<ElfW(Dyn)> entries(dynamic->p_filesz / sizeof(ElfW(Dyn)));
-    if (!fetch(entries.data(), entries.size() * sizeof(ElfW(Dyn)), dynamic->p_offset))
-        return false;
-
-    std::uint64_t table = 0;
-    std::uint64_t tableSize = 0;
-    std::vector<std::uint64_t> strings;
-    for (auto const& entry : entries) {
-        if (entry.d_tag == DT_NULL)
-            break;
-        if (entry.d_tag == DT_STRTAB)
-            table = entry.d_un.d_ptr;
-        else if (entry.d_tag == DT_STRSZ)
-            tableSize = entry.d_un.d_val;
-        else if (entry.d_tag == DT_RPATH || entry.d_tag == DT_RUNPATH || entry.d_tag == DT_NEEDED)
-            strings.push_back(entry.d_un.d_val);
-    }
-    if (strings.empty() || tableSize == 0)
-        return false;
-    // The string table is given by address; the loadable segment holding it
-    // says where that is in the file.
-    std::uint64_t tableOffset = 0;
-    bool found = false;
-    for (auto const& segment : segments) {
-        if (segment.p_type == PT_LOAD && table >= segment.p_vaddr &&
-            table < segment.p_vaddr + segment.p_filesz) {
-            tableOffset = table - segment.p_vaddr + segment.p_offset;
-            found = true;
-            break;
-        }
-    }
-    constexpr std::uint64_t kMaxTable = 1u << 24;
-    if (!found || tableSize > kMaxTable)
-        return false;
-    std::string text(static_cast<std::size_t>(tableSize), '\0');
-    if (!fetch(&text[0], text.size(), tableOffset))
-        return false;
-    for (std::uint64_t at : strings) {
-        if (at >= text.size())
-            continue;
-        char const* const value = text.c_str() + at;
-        if (std::strstr(value, "$ORIGIN") != nullptr || std::strstr(value, "${ORIGIN}") != nullptr)
-            return true;
-    }
-    return false;
+    struct link_map* map = nullptr;
+    if (dlinfo(library, RTLD_DI_LINKMAP, &map) != 0 || map == nullptr || map->l_ld == nullptr)
+        return Mapped::unknown;
+    auto const address = reinterpret_cast<std::uintptr_t>(map->l_ld);
+    MappingQuery query{};
+    query.size = sizeof query;
+    query.address = address;
+    if (maps < 0 || ::ioctl(maps, kProcmapQuery, &query) != 0)
+        return maps >= 0 && errno == ENOENT ? Mapped::unknown : mappedFromText(address, st);
+    return makedev(query.devMajor, query.devMinor) == st.st_dev && query.inode == st.st_ino
+               ? Mapped::fromFile
+               : Mapped::fromOther;
 }
 
 // The loader's message for the last failure, or the fallback text.
@@ -511,9 +417,8 @@ std::string loaderError(char const* fallback)
 
 // Whether an object the loader holds is known by name. The loader looks a
 // name up among the objects it holds before it opens anything: a library
-// closed since but still mapped (unique symbols, -z nodelete) keeps the name
-// /proc/self/fd/<n> of a descriptor number that may now be reused. Looking
-// costs no system call.
+// closed since but still mapped (unique symbols, -z nodelete) keeps its name
+// after its file was replaced. Looking costs no system call.
 bool nameHeld(std::string const& name)
 {
     return dl_iterate_phdr(
@@ -526,65 +431,44 @@ bool nameHeld(std::string const& name)
                const_cast<std::string*>(&name)) != 0;
 }
 
-// Loads the library through the name /proc/self/fd/<fd>, which the kernel
-// resolves to the very file the descriptor holds. A name already held is
-// left for another descriptor number. The loader may still hand back an
-// object it holds under another name (an added name, a soname, or the same
-// file mapped before): that is accepted only when it was mapped from the
-// checked file. On return fd is the descriptor actually used.
-void* loadThroughDescriptor(Descriptor& fd, struct stat const& st, std::string& reason)
+// Loads the judged file by its path, under which the loader, debuggers and
+// $ORIGIN then know it, and keeps it only when the object the loader mapped
+// is the judged inode. An object that stays mapped under that name after the
+// close of a mismatch is one the loader held before (from a file since
+// replaced), not a file swapped in now: the name is then spelled anew
+// ("dir/./name") so that the loader opens the file. On return name is the
+// name the loader knows the library by.
+void* loadJudged(std::string& name, struct stat const& st, int maps, bool enforce, std::string& reason)
 {
-    constexpr int kAttempts = 64;
+    constexpr int kAttempts = 8;
     for (int attempt = 0; attempt < kAttempts; ++attempt) {
-        std::string const name = descriptorName(fd.get());
-        if (!nameHeld(name)) {
-            dlerror();
-            // RTLD_NOW: an unresolved symbol shows now, before any of the
-            // library's constructors run, not as a crash at first call.
-            // RTLD_LOCAL: plug-ins export the same names and must not see
-            // each other's.
-            void* const library = dlopen(name.c_str(), RTLD_NOW | RTLD_LOCAL);
-            if (library == nullptr) {
-                reason = loaderError("unknown loader error");
-                return nullptr;
-            }
-            struct link_map* map = nullptr;
-            if (dlinfo(library, RTLD_DI_LINKMAP, &map) == 0 && map != nullptr &&
-                map->l_name != nullptr && name == map->l_name)
-                return library; // mapped just now, from the descriptor
-            if (mappedFrom(library, st))
-                return library;
-            dlclose(library);
-        }
-        int const other = ::fcntl(fd.get(), F_DUPFD_CLOEXEC, fd.get() + 1);
-        if (other < 0) {
-            reason = errorText(errno);
+        dlerror();
+        // RTLD_NOW: an unresolved symbol shows now, before any of the
+        // library's constructors run, not as a crash at first call.
+        // RTLD_LOCAL: plug-ins export the same names and must not see each
+        // other's.
+        void* const library = dlopen(name.c_str(), RTLD_NOW | RTLD_LOCAL);
+        if (library == nullptr) {
+            reason = loaderError("unknown loader error");
             return nullptr;
         }
-        fd.reset(other);
-    }
-    reason = "every descriptor name tried is held by another loaded library";
-    return nullptr;
-}
-
-// Loads the library by its resolved path. With the checks on, every
-// directory on that path was just found writable by root or the effective
-// user only, so only they could have swapped the file since; what was mapped
-// is compared with what was checked all the same.
-void* loadThroughPath(std::string const& resolved, struct stat const& st, std::string& reason)
-{
-    dlerror();
-    void* const library = dlopen(resolved.c_str(), RTLD_NOW | RTLD_LOCAL);
-    if (library == nullptr) {
-        reason = loaderError("unknown loader error");
-        return nullptr;
-    }
-    if (!mappedFrom(library, st)) {
+        Mapped const mapped = mappedFrom(library, st, maps);
+        if (mapped == Mapped::fromFile || (mapped == Mapped::unknown && !enforce))
+            return library;
         dlclose(library);
-        reason = "the file changed while it was being loaded";
-        return nullptr;
+        if (mapped == Mapped::unknown) {
+            reason = "cannot tell which file the loader mapped (no /proc/self/maps)";
+            return nullptr;
+        }
+        // Still held after this close: an object that stays mapped.
+        if (!nameHeld(name)) {
+            reason = "the file changed while it was being loaded";
+            return nullptr;
+        }
+        name.insert(name.rfind('/') + 1, "./");
     }
-    return library;
+    reason = "every name tried is held by another loaded library";
+    return nullptr;
 }
 
 } // namespace
@@ -593,9 +477,9 @@ void* loadThroughPath(std::string const& resolved, struct stat const& st, std::s
 // it saw, and that directory's descriptor.
 struct PlatformUtilities::Scan::State {
     std::string directory; // as the caller spelled it
-    std::vector<std::string> paths;
-    std::vector<struct stat> stats;
+    Chain chain;
     Descriptor dir;
+    Descriptor maps; // /proc/self/maps, asked which file each library came from
 };
 
 namespace {
@@ -614,18 +498,15 @@ bool walkInScan(PlatformUtilities::Scan::State* scan, std::string const& file, W
         std::string const name = file.substr(slash + 1);
         if (name.empty() || name == "." || name == "..")
             return false;
-        walk.paths = scan->paths;
-        walk.stats = scan->stats;
+        walk.dirs = &scan->chain;
         walk.dir = scan->dir.get();
-        walk.dirs = walk.stats.size();
         return finishWalk(walk, name, reason);
     }
     bool const walked = walkPath(file, walk, reason);
     if (scan != nullptr && walk.ownDir.valid()) {
         scan->directory = file.substr(0, slash);
-        auto const dirs = static_cast<std::ptrdiff_t>(walk.dirs);
-        scan->paths.assign(walk.paths.begin(), walk.paths.begin() + dirs);
-        scan->stats.assign(walk.stats.begin(), walk.stats.begin() + dirs);
+        scan->chain = std::move(walk.own);
+        walk.dirs = &scan->chain;
         scan->dir = std::move(walk.ownDir);
     }
     return walked;
@@ -675,61 +556,48 @@ _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
     // A path without links is walked as given. Otherwise links are resolved
     // first; what is checked, and loaded, is the file they lead to, along
     // the directories that hold it.
-    Walk walk;
-    std::string resolved = path;
-    if (path[0] != '/' || resolved.back() == '/' ||
-        !walkInScan(currentScan != nullptr ? currentScan->state_ : nullptr, resolved, walk, reason)) {
+    PlatformUtilities::Scan::State* const scan = currentScan != nullptr ? currentScan->state_ : nullptr;
+    Walk asGiven, asResolved;
+    Walk* walk = &asGiven;
+    std::size_t const length = std::strlen(path);
+    if (path[0] != '/' || path[length - 1] == '/' || !walkInScan(scan, path, asGiven, reason)) {
         std::unique_ptr<char, decltype(&std::free)> const real(realpath(path, nullptr), &std::free);
         if (!real) {
             int const error = errno;
             SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", errorText(error));
             return nullptr;
         }
-        resolved = real.get();
-        walk = Walk();
-        walkPath(resolved, walk, reason);
+        walk = &asResolved;
+        walkPath(real.get(), asResolved, reason);
     }
     // A refusal on the way is reported before whatever stopped the walk.
-    if ((enforce && !chainTrusted(walk, reason)) || !walk.complete) {
+    if ((enforce && !chainTrusted(*walk, reason)) || !walk->complete) {
         SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", reason);
         return nullptr;
     }
-    resolved = walk.paths.back();
     if (!enforce)
         SD_LOG(LEVEL_WARNING, "Plug-in trust checks are off (", kTrustVariable, "=off): loading ", path,
                " without checking its owners and permissions");
+    walk->ownDir.reset();
 
-    // Only a judged regular file is ever opened.
-    reason.clear();
-    Descriptor file = openJudged(walk, reason);
-    walk.ownDir.reset();
-    if (!reason.empty()) {
-        SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", reason);
-        return nullptr;
-    }
-    struct stat const& st = walk.stats.back();
-    bool const byDescriptor = file.valid() && !usesOrigin(file.get());
-
-    void* library = nullptr;
-    std::string usedName;
-    if (byDescriptor) {
-        library = loadThroughDescriptor(file, st, reason);
-        usedName = descriptorName(file.get());
-        // Without /proc the name leads nowhere; the path is all there is.
-        if (library == nullptr && ::access(usedName.c_str(), F_OK) != 0) {
-            library = loadThroughPath(resolved, st, reason);
-            usedName = resolved;
-        }
-    } else {
-        library = loadThroughPath(resolved, st, reason);
-        usedName = resolved;
-    }
+    // Every directory down to the file was just found writable by root or
+    // the effective user only: nobody else can replace the file before the
+    // loader opens it. What the loader mapped is compared with what was
+    // judged all the same.
+    Descriptor ownMaps;
+    if (scan == nullptr || !scan->maps.valid())
+        ownMaps.reset(::open("/proc/self/maps", O_RDONLY | O_CLOEXEC));
+    int const maps = ownMaps.valid() || scan == nullptr ? ownMaps.get() : scan->maps.get();
+    std::string loadedAs = walk->file;
+    void* const library = loadJudged(loadedAs, walk->fileStat, maps, enforce, reason);
+    if (scan != nullptr && ownMaps.valid())
+        scan->maps = std::move(ownMaps);
     if (library == nullptr) {
-        SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", renamed(reason, usedName, path));
+        SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": ", renamed(reason, loadedAs, path));
         return nullptr;
     }
     try {
-        return new _LibraryHandle{library, path, usedName, file.release()};
+        return new _LibraryHandle{library, path, loadedAs};
     } catch (std::bad_alloc const&) {
         dlclose(library);
         SD_LOG(LEVEL_FAILURE, "Cannot load library ", path, ": out of memory");
@@ -757,9 +625,6 @@ void PlatformUtilities::unloadLibrary(_LibraryHandle* handle)
         return;
     if (handle->library != nullptr)
         dlclose(handle->library);
-    // Only now: the name /proc/self/fd/<n> stays reserved while it is loaded.
-    if (handle->descriptor >= 0)
-        ::close(handle->descriptor);
     delete handle;
 }
 

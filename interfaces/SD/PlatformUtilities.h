@@ -36,14 +36,13 @@ public:
     // below it is owned by root or the effective user.
     //
     // The path is checked one component at a time, each opened relative to
-    // the directory checked before it without following links, and the
-    // library is loaded through /proc/self/fd of the descriptor that was
-    // checked, so that a file swapped in after the check is not the one
-    // loaded. A library whose run path or dependencies use $ORIGIN is
-    // loaded by its resolved path instead (the loader would work $ORIGIN out
-    // from the /proc name), and what was mapped is compared with what was
-    // checked. Not covered: the libraries it depends on are found and loaded
-    // by the system loader without these checks.
+    // the directory checked before it without following links. The library
+    // is then loaded by its resolved path, so that the loader, debuggers and
+    // $ORIGIN know it by its own name; nobody but root or the effective user
+    // can have replaced it in between. It is kept only when the loader
+    // mapped the inode that was checked. Not covered: the libraries it
+    // depends on are found and loaded by the system loader without these
+    // checks.
     //
     // IC_PLUGIN_TRUST=off (read on every call) switches the owner and
     // permission checks off for development; each load then logs a warning

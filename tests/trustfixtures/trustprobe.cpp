@@ -5,6 +5,8 @@
 #include <cstdio>
 #include <cstdlib>
 
+#include <dlfcn.h>
+
 #ifndef TRUST_NAME
 #error "TRUST_NAME must be set"
 #endif
@@ -63,6 +65,14 @@ __attribute__((visibility("default"))) char const* trust_whoami()
 __attribute__((visibility("default"))) int trust_count()
 {
     return trust_counter;
+}
+
+// The file this library is, as the loader names it to anyone who asks: what
+// a plug-in uses to find its data files or name itself.
+__attribute__((visibility("default"))) char const* trust_file()
+{
+    Dl_info info{};
+    return dladdr(reinterpret_cast<void*>(&trust_file), &info) != 0 ? info.dli_fname : "";
 }
 
 } // extern "C"
