@@ -49,7 +49,7 @@ if [[ $soak -eq 1 ]]; then
 fi
 
 if [[ $quick -eq 0 ]]; then
-  export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1:detect_stack_use_after_return=1
+  export ASAN_OPTIONS=detect_leaks=1:abort_on_error=1:detect_stack_use_after_return=1:intercept_tls_get_addr=0
   export UBSAN_OPTIONS=halt_on_error=1:print_stacktrace=1
   build_and_test asan -LE soak-long -- -DIC_SANITIZE=address,undefined
 fi
