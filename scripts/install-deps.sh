@@ -9,6 +9,7 @@ packages=(
   liblog4cxx-dev
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
+  openipmi freeipmi-tools libipmimonitoring-dev libfreeipmi-dev
 )
 
 missing=()
