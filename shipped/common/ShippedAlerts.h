@@ -88,6 +88,24 @@ inline bool conditionOf(IC::Node const& node, std::vector<IC::Alert>& out)
     return true;
 }
 
+// Shows on node the state and the condition its interface has asserted
+// (status raised, class cls, message; status 1: none), changing only what
+// differs.
+inline void showCondition(IC::Node& node, std::string const& state, unsigned int raised,
+                          IC::Alert::ClassType cls, std::string const& message)
+{
+    IC::Node::Property p;
+    if (!node.getProperty("state", &p) || p.value != state)
+        node.setProperty("state", state);
+    if (raised == kStatusNormal) {
+        node.removeProperty(kConditionProperty);
+        node.removeProperty(kConditionClassProperty);
+    } else if (!node.getProperty(kConditionProperty, &p) || p.value != message) {
+        node.setProperty(kConditionProperty, message);
+        node.setProperty(kConditionClassProperty, std::to_string(cls));
+    }
+}
+
 // A short name of a class for people ("threshold"); "class N" for others.
 inline char const* className(unsigned int cls)
 {

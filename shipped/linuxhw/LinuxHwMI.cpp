@@ -3,6 +3,8 @@
 #include "DeviceScanner.h"
 #include "HwmonScanner.h"
 #include "Log.h"
+#include "SharedTree.h"
+#include "OpenShippedMI.h"
 #include "ShippedAlerts.h"
 #include "SystemScanner.h"
 
@@ -86,11 +88,12 @@ LinuxHwMI::~LinuxHwMI()
 }
 
 void LinuxHwMI::registerNodeCallBacks(IC::NodeArrivalCallBack arrival, void const* context,
-                                      IC::NodeLookupCallBack)
+                                      IC::NodeLookupCallBack lookup)
 {
     SD::MutexGuard g(lock_);
     arrivalCB_ = arrival;
     arrivalContext_ = context;
+    lookup_ = lookup;
 }
 
 IC::Error LinuxHwMI::registerForAlerts(IC::AlertCallBack callback, void const* context)
@@ -114,6 +117,12 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         base_ = nodeIdBase & 0xFFFF0000u;
         pollMs_ = ms;
         reader_ = std::make_unique<SysfsReader>(root);
+        // The shared top of the tree (SharedTree.h): what another plug-in
+        // already reports is adopted by id, not reported again.
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, base_, shipped::kRootPath))
+            adopted_[kRootKey] = id;
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, base_, shipped::kChassisPath))
+            adopted_[kChassisKey] = id;
     }
     if (!reader_->isDirectory("sys") && !reader_->isDirectory("proc"))
         LHW_LOG(kError, "no sys or proc directory below ", reader_->root(),
@@ -246,7 +255,7 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
     std::set<std::string> seen;
     std::size_t leftOut = 0;
     for (Device const& d : found) {
-        if (!seen.insert(d.key).second)
+        if (!seen.insert(d.key).second || adopted_.count(d.key) != 0)
             continue; // two entries of one identity: the first one counts
         auto it = tracked_.find(d.key);
         if (it != tracked_.end() && it->second.present) {
@@ -254,7 +263,9 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
             continue;
         }
         unsigned int parentId = 0;
-        if (!d.parentKey.empty()) {
+        if (auto const adopted = adopted_.find(d.parentKey); adopted != adopted_.end()) {
+            parentId = adopted->second;
+        } else if (!d.parentKey.empty()) {
             auto const parent = tracked_.find(d.parentKey);
             if (parent == tracked_.end() || !parent->second.present || !parent->second.node) {
                 LHW_LOG(kWarning, d.description, " left out: its parent ", d.parentKey,
@@ -495,16 +506,5 @@ void LinuxHwMI::deliver(Outbox& out)
 extern "C" __attribute__((visibility("default"))) unsigned char
 OpenMI(IC::ManagementInterface** mi, IC::Error** err)
 {
-    static IC::Error good(0, IC::Number(IC::Number::Generic), std::string());
-    static IC::Error bad(1, IC::Number(IC::Number::Generic), "linuxhw: out of memory");
-    if (!mi || !err)
-        return 1;
-    try {
-        *mi = new linuxhw::LinuxHwMI();
-    } catch (...) {
-        *err = &bad;
-        return 1;
-    }
-    *err = &good;
-    return 0;
+    return shipped::openMI<linuxhw::LinuxHwMI>(mi, err, "linuxhw");
 }

@@ -133,6 +133,10 @@ private:
     std::map<std::tuple<std::string, unsigned int, unsigned int>, std::string> claims_;
     // Every node ever handed out: the library may hold them until release().
     std::vector<std::unique_ptr<HwNode>> nodes_;
+    // Keys of ROOT and Chassis when another plug-in reports them: the id of
+    // its node, set in Initialize (see shipped/common/SharedTree.h).
+    std::map<std::string, unsigned int> adopted_;
+    IC::NodeLookupCallBack lookup_ = nullptr;
 
     // Set before the polling thread starts, fixed afterwards.
     IC::AlertCallBack alertCB_ = nullptr;
