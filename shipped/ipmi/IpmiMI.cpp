@@ -264,7 +264,7 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
     if (!b.reachable)
         IPMI_LOG(kProgress, b.label, " answers again");
     b.reachable = true;
-    judge(b.bmcNode, "ok", b.label + " answers", out);
+    judge(b.bmcNode, "ok", b.label + " answers again", out);
     for (Sensor const& s : sensors) {
         std::string const key = std::to_string(s.entityId) + "." + std::to_string(s.entityInstance) + "/" + s.name;
         auto it = b.sensors.find(key);
