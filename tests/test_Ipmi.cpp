@@ -249,6 +249,27 @@ TEST_F(IpmiTest, StoppedBmcIsUnknownAndComesBack)
     expectAlerts("Inlet Temp", {"5/3"});
 }
 
+// A record added to the event log raises one event-log alert on the BMC;
+// a restart does not raise it again.
+TEST_F(IpmiTest, SelRecordRaisesOnceAcrossRestarts)
+{
+    std::string const bmc = "BMC sim (127.0.0.1:" + std::to_string(lan_) + ")";
+    open();
+    console("sel_add 0x20 0x02 0 0 0 0 0x20 0x00 0x04 0x08 0x07 0x6f 0x01 0xff 0xff");
+    expectAlerts(bmc, {"9/1"});
+    std::vector<std::string> messages;
+    for (ictest::AlertCall const& call : ictest::Recorder::get().calls(this))
+        for (Alert const& a : call.alerts)
+            if (a.getClass() == 9)
+                messages.push_back(std::to_string(a.getSeverity()) + " " + a.getMessage());
+    EXPECT_EQ(messages, (std::vector<std::string>{"2 " + bmc + " SEL record 1: PS1 Status: Power Supply Failure detected"}));
+    close();
+    ictest::Recorder::get().reset();
+    open();
+    std::this_thread::sleep_for(std::chrono::milliseconds(1000)); // five polls
+    EXPECT_EQ(alerts(bmc), std::vector<std::string>{});
+}
+
 // Bad sections are each one error line naming the file and line; the good
 // BMC still loads; a wrong password is a condition on its BMC, not a crash.
 TEST_F(IpmiTest, ConfigurationErrorsLeaveOutOnlyTheirBmc)

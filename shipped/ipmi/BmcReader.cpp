@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <fstream>
 
 namespace ipmi {
 
@@ -79,8 +81,32 @@ std::string cacheFileIn(std::string const& dir)
 } // namespace
 
 BmcReader::BmcReader(BmcConfig config, std::string cacheDir)
-    : config_(std::move(config)), cacheDir_(std::move(cacheDir))
+    : config_(std::move(config)), cacheDir_(std::move(cacheDir)),
+      host_(config_.host + ":" + std::to_string(config_.port))
 {
+}
+
+char const* BmcReader::hostname() const
+{
+    return config_.name.empty() ? nullptr : host_.c_str();
+}
+
+ipmi_monitoring_ipmi_config BmcReader::ipmiConfig() const
+{
+    ipmi_monitoring_ipmi_config cfg{};
+    cfg.driver_type = IPMI_MONITORING_DRIVER_TYPE_OPENIPMI;
+    cfg.disable_auto_probe = 1;
+    cfg.driver_device = const_cast<char*>("/dev/ipmi0"); // in-band: the OpenIPMI driver only
+    cfg.protocol_version = IPMI_MONITORING_PROTOCOL_VERSION_2_0;
+    cfg.username = const_cast<char*>(config_.user.c_str());
+    cfg.password = const_cast<char*>(config_.password.c_str());
+    cfg.privilege_level = config_.privilege;
+    cfg.authentication_type = -1;
+    cfg.cipher_suite_id = config_.cipherSuite;
+    cfg.session_timeout_len = kSessionTimeoutMs;
+    cfg.retransmission_timeout_len = 500;
+    cfg.workaround_flags = config_.workarounds;
+    return cfg;
 }
 
 BmcReader::~BmcReader()
@@ -157,23 +183,9 @@ bool BmcReader::read(std::vector<Sensor>& out, std::string& error)
         error = std::string("SDR cache directory ") + cacheDir_ + ": " + ipmi_monitoring_ctx_errormsg(ctx_);
         return false;
     }
-    ipmi_monitoring_ipmi_config cfg{};
-    cfg.driver_type = IPMI_MONITORING_DRIVER_TYPE_OPENIPMI;
-    cfg.disable_auto_probe = 1;
-    cfg.driver_device = const_cast<char*>("/dev/ipmi0"); // in-band: the OpenIPMI driver only
-    cfg.protocol_version = IPMI_MONITORING_PROTOCOL_VERSION_2_0;
-    cfg.username = const_cast<char*>(config_.user.c_str());
-    cfg.password = const_cast<char*>(config_.password.c_str());
-    cfg.privilege_level = config_.privilege;
-    cfg.authentication_type = -1;
-    cfg.cipher_suite_id = config_.cipherSuite;
-    cfg.session_timeout_len = kSessionTimeoutMs;
-    cfg.retransmission_timeout_len = 500;
-    cfg.workaround_flags = config_.workarounds;
-    std::string const host = config_.host + ":" + std::to_string(config_.port);
-    char const* hostname = config_.name.empty() ? nullptr : host.c_str();
+    ipmi_monitoring_ipmi_config cfg = ipmiConfig();
     unsigned int const flags = IPMI_MONITORING_SENSOR_READING_FLAGS_DISCRETE_READING;
-    int const n = ipmi_monitoring_sensor_readings_by_record_id(ctx_, hostname, &cfg, flags, nullptr, 0, nullptr, nullptr);
+    int const n = ipmi_monitoring_sensor_readings_by_record_id(ctx_, hostname(), &cfg, flags, nullptr, 0, nullptr, nullptr);
     if (n < 0) {
         error = ipmi_monitoring_ctx_errormsg(ctx_);
         return false;
@@ -214,6 +226,91 @@ bool BmcReader::read(std::vector<Sensor>& out, std::string& error)
                 s.event += (s.event.empty() ? "" : "; ") + std::string(*words);
         out.push_back(std::move(s));
     }
+    return true;
+}
+
+namespace {
+
+struct SelState {
+    unsigned int lastId = 0;
+    unsigned long long added = 0;
+    unsigned long long erased = 0;
+};
+
+// The SEL's last add and erase time stamps, through libfreeipmi.
+bool selInfo(BmcConfig const& c, char const* hostname, SelState& info, std::string& error)
+{
+    ipmi_ctx_t ctx = ipmi_ctx_create();
+    fiid_obj_t rs = fiid_obj_create(tmpl_cmd_get_sel_info_rs);
+    bool done = false;
+    if (ctx && rs) {
+        int const opened =
+            hostname ? ipmi_ctx_open_outofband_2_0(ctx, hostname, c.user.c_str(), c.password.c_str(), nullptr, 0,
+                                                   static_cast<uint8_t>(c.privilege + IPMI_PRIVILEGE_LEVEL_USER),
+                                                   static_cast<uint8_t>(c.cipherSuite), BmcReader::kSessionTimeoutMs,
+                                                   500, c.workarounds, 0)
+                     : ipmi_ctx_open_inband(ctx, IPMI_DEVICE_OPENIPMI, 1, 0, 0, "/dev/ipmi0", 0, 0);
+        uint64_t added = 0, erased = 0;
+        if (opened < 0)
+            error = ipmi_ctx_errormsg(ctx);
+        else if (ipmi_cmd_get_sel_info(ctx, rs) < 0 ||
+                 fiid_obj_get(rs, "most_recent_addition_timestamp", &added) < 0 ||
+                 fiid_obj_get(rs, "most_recent_erase_timestamp", &erased) < 0)
+            error = ipmi_ctx_errormsg(ctx);
+        else
+            done = true;
+        info.added = added;
+        info.erased = erased;
+        if (opened >= 0)
+            ipmi_ctx_close(ctx);
+    }
+    if (rs)
+        fiid_obj_destroy(rs);
+    if (ctx)
+        ipmi_ctx_destroy(ctx);
+    return done;
+}
+
+} // namespace
+
+bool BmcReader::newEvents(std::vector<SelEvent>& out, std::string& error)
+{
+    std::string const stateFile = cacheDir_ + "/sel-seen";
+    SelState seen, now;
+    bool const known = static_cast<bool>(std::ifstream(stateFile) >> seen.lastId >> seen.added >> seen.erased);
+    if (!selInfo(config_, hostname(), now, error))
+        return false;
+    if (known && now.added == seen.added && now.erased == seen.erased)
+        return true;
+    ipmi_monitoring_ipmi_config cfg = ipmiConfig();
+    int const n = ipmi_monitoring_sel_by_record_id(ctx_, hostname(), &cfg, 0, nullptr, 0, nullptr, nullptr);
+    if (n < 0 && ipmi_monitoring_ctx_errnum(ctx_) != IPMI_MONITORING_ERR_NO_SEL_RECORDS) {
+        error = ipmi_monitoring_ctx_errormsg(ctx_);
+        return false;
+    }
+    // After a clear every record is new, whatever its id.
+    bool const cleared = known && now.erased != seen.erased;
+    now.lastId = cleared ? 0 : seen.lastId;
+    for (int i = 0; i < n; ++i, ipmi_monitoring_sel_iterator_next(ctx_)) {
+        int const id = ipmi_monitoring_sel_read_record_id(ctx_);
+        if (id < 0 || (!cleared && static_cast<unsigned int>(id) <= seen.lastId))
+            continue;
+        now.lastId = std::max(now.lastId, static_cast<unsigned int>(id));
+        if (!known)
+            continue; // a log met for the first time is history, not news
+        SelEvent e;
+        e.id = static_cast<unsigned int>(id);
+        e.state = ipmi_monitoring_sel_read_sel_state(ctx_);
+        char const* sensor = ipmi_monitoring_sel_read_sensor_name(ctx_);
+        char const* what = ipmi_monitoring_sel_read_event_offset_string(ctx_);
+        e.sensor = sensor ? sensor : "";
+        e.text = std::string("SEL record ") + std::to_string(id) + ": " + (sensor ? sensor : "no sensor") + ": " +
+                 (what ? what : "unknown event");
+        out.push_back(std::move(e));
+    }
+    std::ofstream(stateFile + ".new") << now.lastId << ' ' << now.added << ' ' << now.erased << '\n';
+    if (std::rename((stateFile + ".new").c_str(), stateFile.c_str()) != 0)
+        IPMI_LOG(kWarning, "cannot keep the SEL seen-state in ", stateFile, ": ", std::strerror(errno));
     return true;
 }
 

@@ -33,6 +33,14 @@ struct Sensor {
     std::string event; // FreeIPMI's words for what the sensor says
 };
 
+// A new record of the BMC's event log (SEL).
+struct SelEvent {
+    unsigned int id = 0;
+    std::string sensor; // the sensor's name; "" when the record names none
+    std::string text;
+    int state = 0; // IPMI_MONITORING_STATE_*
+};
+
 class BmcReader {
 public:
     // The session time-out: a BMC that does not answer fails a pass after
@@ -48,6 +56,13 @@ public:
     // be read.
     bool read(std::vector<Sensor>& out, std::string& error);
 
+    // The SEL records added since the last call, by the seen-state kept in
+    // the cache directory: the last record id with the SEL's last add and
+    // erase time stamps, since record ids restart after a clear. A BMC seen
+    // for the first time has its log taken as seen. False when the BMC could
+    // not be asked.
+    bool newEvents(std::vector<SelEvent>& out, std::string& error);
+
     BmcConfig const& config() const { return config_; }
 
 private:
@@ -58,6 +73,8 @@ private:
         std::array<std::optional<double>, 4> thresholds;
     };
     void loadSdrFacts();
+    ipmi_monitoring_ipmi_config ipmiConfig() const;
+    char const* hostname() const;
 
     BmcConfig const config_;
     std::string const cacheDir_;
@@ -65,6 +82,7 @@ private:
     std::map<int, SdrFacts> facts_; // by SDR record id, for this cache file
     std::string factsFile_;
     std::time_t factsTime_ = 0;
+    std::string host_; // "host:port"; unused in-band
 };
 
 } // namespace ipmi

@@ -243,8 +243,11 @@ void IpmiMI::judge(Tracked& t, std::string const& state, std::string const& mess
 void IpmiMI::readBmc(Bmc& b, Outbox& out)
 {
     std::vector<Sensor> sensors;
-    std::string error;
+    std::vector<SelEvent> events;
+    std::string error, selError;
     bool const answered = b.reader->read(sensors, error);
+    if (answered && !b.reader->newEvents(events, selError))
+        IPMI_LOG(kWarning, b.label, ": the event log could not be read: ", selError);
     std::lock_guard<std::mutex> g(lock_);
     if (!answered) {
         ++b.failures;
@@ -294,6 +297,16 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
                                     (s.reading ? number(*s.reading) + (s.unit.empty() ? "" : " " + s.unit) + " " : "") +
                                     s.state + (s.event.empty() ? "" : ": " + s.event);
         judge(it->second, s.state, message, out);
+    }
+    std::string const bmcPath = b.bmcNode.node->knownPath();
+    for (SelEvent const& e : events) {
+        unsigned char const severity = e.state == IPMI_MONITORING_STATE_CRITICAL  ? shipped::kSeverityCritical
+                                       : e.state == IPMI_MONITORING_STATE_WARNING ? shipped::kSeverityWarning
+                                                                                  : shipped::kSeverityInfo;
+        IPMI_LOG(severity == shipped::kSeverityInfo ? kProgress : kWarning, b.label, " ", e.text);
+        if (!bmcPath.empty())
+            out.alerts.emplace_back(severity, shipped::kEventLog, std::vector<std::string>{bmcPath},
+                                    shipped::kStatusNormal, b.label + " " + e.text);
     }
 }
 
