@@ -5,6 +5,7 @@
 #include <freeipmi/freeipmi.h>
 
 #include <dirent.h>
+#include <dlfcn.h>
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -17,9 +18,21 @@ namespace ipmi {
 
 namespace {
 
+// Keeps the library holding fn loaded for good: FreeIPMI's global state
+// (made by ipmi_monitoring_init, which has no counterpart) would otherwise
+// be lost, and made again, every time a reload unloads this plug-in.
+void pin(void* fn)
+{
+    Dl_info info{};
+    if (::dladdr(fn, &info) != 0 && info.dli_fname)
+        ::dlopen(info.dli_fname, RTLD_NOW | RTLD_NOLOAD | RTLD_NODELETE);
+}
+
 bool initLibrary()
 {
     static bool const ok = [] {
+        pin(reinterpret_cast<void*>(&ipmi_monitoring_init));
+        pin(reinterpret_cast<void*>(&ipmi_ctx_create));
         int err = 0;
         return ipmi_monitoring_init(0, &err) == 0;
     }();
