@@ -313,7 +313,8 @@ TEST_F(IpmiTest, ConfigurationErrorsLeaveOutOnlyTheirBmc)
     EXPECT_EQ(errors, expected);
     std::vector<Node*> all;
     ic_->getAllNodes(all);
-    EXPECT_EQ(std::count_if(all.begin(), all.end(), [](Node* n) { return n->getSensor() == Node::Chassis; }), 2);
+    EXPECT_EQ(std::count_if(all.begin(), all.end(), [](Node* n) { return n->getSensor() == Node::Chassis; }),
+              3); // this server's and the two BMCs' 
     EXPECT_NE(byName("Inlet Temp"), nullptr);
     std::string const wrongBmc = "BMC wrong (127.0.0.1:" + std::to_string(lan_) + ")";
     EXPECT_EQ(prop(wrongBmc, "state"), "critical");

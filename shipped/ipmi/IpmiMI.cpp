@@ -11,6 +11,7 @@
 #include <sys/stat.h>
 
 #include <cstdio>
+#include <filesystem>
 #include <cstdlib>
 
 #ifndef IC_IPMI_DEFAULT_CONFIG
@@ -134,7 +135,10 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     if (inBand)
         configs.insert(configs.begin(), BmcConfig());
     std::string const dataDir = SD::PlatformUtilities::getBriscaDataDir() + "/ipmi";
-    ::mkdir(dataDir.c_str(), 0700);
+    std::error_code ec;
+    std::filesystem::create_directories(dataDir, ec);
+    if (ec)
+        IPMI_LOG(kError, "cannot make ", dataDir, " (", ec.message(), "): no SDR cache, no SEL seen-state");
 
     std::unique_lock<std::mutex> g(lock_);
     if (initialized_)
@@ -153,8 +157,10 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     unsigned int chassisId = shipped::adoptedNodeId(lookup_, base_, shipped::kChassisPath);
     if (rootId == 0)
         rootId = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
-    if (chassisId == 0 && inBand)
-        chassisId = newNode(Node::Chassis, 0, rootId, "System (from its BMC)")->getNodeId();
+    // The host's chassis too, even with out-of-band BMCs only, so that a
+    // plug-in loaded later finds the whole shared top.
+    if (chassisId == 0)
+        chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
     std::set<unsigned int> chassisInstances{0};
     for (BmcConfig& c : configs) {
         auto b = std::make_unique<Bmc>();
