@@ -196,6 +196,29 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndStartFaultsAreShown)
     EXPECT_EQ(byName("Inlet Temp")->getLinkedId(), bmc->getLinkedId());
 }
 
+// With linuxhw (loaded after ipmi, by file name) there is one ROOT and one
+// Chassis 0: linuxhw adopts what ipmi reported.
+TEST_F(IpmiTest, OneTreeWithLinuxhw)
+{
+    fs::create_symlink(LINUXHW_PLUGIN, tmp_.path("mi/linuxhw.so"));
+    ictest::EnvGuard sysfs("IC_SYSFS_ROOT", LINUXHW_EXAMPLES "/small");
+    open();
+    std::vector<Node*> all;
+    ic_->getAllNodes(all);
+    std::multiset<std::string> top;
+    for (Node* n : all)
+        if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
+            top.insert(ic_->getNodeHierarchy(n));
+    Node* bmc = byName("BMC sim (127.0.0.1:" + std::to_string(lan_) + ")");
+    ASSERT_NE(bmc, nullptr);
+    Node* bmcChassis = nullptr;
+    ASSERT_EQ(ic_->getNode(bmc->getLinkedId(), &bmcChassis).getStatus(), 0);
+    EXPECT_EQ(top, (std::multiset<std::string>{"ROOT:00000000", "ROOT:00000000->Chassis:00000000",
+                                               ic_->getNodeHierarchy(bmcChassis)}));
+    EXPECT_EQ(ic_->getNodeHierarchy(byName("CPU 0 core 0")),
+              "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+}
+
 // Each change made through the simulator's console raises exactly one
 // alert; a reading that stays raises nothing more.
 TEST_F(IpmiTest, ConsoleChangesRaiseExactlyOneAlertEach)
