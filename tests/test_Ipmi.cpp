@@ -194,6 +194,8 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndStartFaultsAreShown)
     ASSERT_NE(bmc, nullptr);
     EXPECT_EQ(ic_->getNodeHierarchy(bmc).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(bmc);
     EXPECT_EQ(byName("Inlet Temp")->getLinkedId(), bmc->getLinkedId());
+    std::string const bmcName = bmc->getDescription();
+    EXPECT_EQ(prop(bmcName, "version") + " " + prop(bmcName, "ipmi_version"), "9.08 2.0"); // as bmc-info says
 }
 
 // With linuxhw (loaded after ipmi, by file name) there is one ROOT and one

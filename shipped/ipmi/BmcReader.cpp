@@ -250,38 +250,43 @@ struct SelState {
     unsigned long long erased = 0;
 };
 
-// The SEL's last add and erase time stamps, through libfreeipmi.
-bool selInfo(BmcConfig const& c, char const* hostname, SelState& info, std::string& error)
+// Runs ask on a libfreeipmi session with the BMC; false with error set when
+// the session or ask fails.
+template <class Ask>
+bool withSession(BmcConfig const& c, char const* hostname, std::string& error, Ask ask)
 {
     ipmi_ctx_t ctx = ipmi_ctx_create();
-    fiid_obj_t rs = fiid_obj_create(tmpl_cmd_get_sel_info_rs);
-    bool done = false;
-    if (ctx && rs) {
-        int const opened =
-            hostname ? ipmi_ctx_open_outofband_2_0(ctx, hostname, c.user.c_str(), c.password.c_str(), nullptr, 0,
-                                                   static_cast<uint8_t>(c.privilege + IPMI_PRIVILEGE_LEVEL_USER),
-                                                   static_cast<uint8_t>(c.cipherSuite), BmcReader::kSessionTimeoutMs,
-                                                   500, c.workarounds, 0)
-                     : ipmi_ctx_open_inband(ctx, IPMI_DEVICE_OPENIPMI, 1, 0, 0, "/dev/ipmi0", 0, 0);
-        uint64_t added = 0, erased = 0;
-        if (opened < 0)
-            error = ipmi_ctx_errormsg(ctx);
-        else if (ipmi_cmd_get_sel_info(ctx, rs) < 0 ||
-                 fiid_obj_get(rs, "most_recent_addition_timestamp", &added) < 0 ||
-                 fiid_obj_get(rs, "most_recent_erase_timestamp", &erased) < 0)
-            error = ipmi_ctx_errormsg(ctx);
-        else
-            done = true;
-        info.added = added;
-        info.erased = erased;
-        if (opened >= 0)
-            ipmi_ctx_close(ctx);
+    if (!ctx) {
+        error = "out of memory";
+        return false;
     }
+    int const opened =
+        hostname ? ipmi_ctx_open_outofband_2_0(ctx, hostname, c.user.c_str(), c.password.c_str(), nullptr, 0,
+                                               static_cast<uint8_t>(c.privilege + IPMI_PRIVILEGE_LEVEL_USER),
+                                               static_cast<uint8_t>(c.cipherSuite), BmcReader::kSessionTimeoutMs,
+                                               500, c.workarounds, 0)
+                 : ipmi_ctx_open_inband(ctx, IPMI_DEVICE_OPENIPMI, 1, 0, 0, "/dev/ipmi0", 0, 0);
+    bool const done = opened >= 0 && ask(ctx);
+    if (!done)
+        error = ipmi_ctx_errormsg(ctx);
+    if (opened >= 0)
+        ipmi_ctx_close(ctx);
+    ipmi_ctx_destroy(ctx);
+    return done;
+}
+
+// Reads the fields of a response template; false when the command fails.
+template <class Command>
+bool fields(ipmi_ctx_t ctx, fiid_template_t tmpl, Command command,
+            std::initializer_list<std::pair<char const*, uint64_t*>> wanted)
+{
+    fiid_obj_t rs = fiid_obj_create(tmpl);
+    bool ok = rs && command(ctx, rs) >= 0;
+    for (auto const& [name, value] : wanted)
+        ok = ok && fiid_obj_get(rs, name, value) >= 0;
     if (rs)
         fiid_obj_destroy(rs);
-    if (ctx)
-        ipmi_ctx_destroy(ctx);
-    return done;
+    return ok;
 }
 
 } // namespace
@@ -291,8 +296,27 @@ bool BmcReader::newEvents(std::vector<SelEvent>& out, std::string& error)
     std::string const stateFile = cacheDir_ + "/sel-seen";
     SelState seen, now;
     bool const known = static_cast<bool>(std::ifstream(stateFile) >> seen.lastId >> seen.added >> seen.erased);
-    if (!selInfo(config_, hostname(), now, error))
+    uint64_t added = 0, erased = 0;
+    bool const wantId = firmware_.empty();
+    uint64_t major = 0, minor = 0, ipmiMajor = 0, ipmiMinor = 0;
+    if (!withSession(config_, hostname(), error, [&](ipmi_ctx_t ctx) {
+            return fields(ctx, tmpl_cmd_get_sel_info_rs, ipmi_cmd_get_sel_info,
+                          {{"most_recent_addition_timestamp", &added}, {"most_recent_erase_timestamp", &erased}}) &&
+                   (!wantId || fields(ctx, tmpl_cmd_get_device_id_rs, ipmi_cmd_get_device_id,
+                                      {{"firmware_revision1.major_revision", &major},
+                                       {"firmware_revision2.minor_revision", &minor},
+                                       {"ipmi_version_major", &ipmiMajor},
+                                       {"ipmi_version_minor", &ipmiMinor}}));
+        }))
         return false;
+    now.added = added;
+    now.erased = erased;
+    if (wantId) {
+        char text[32];
+        std::snprintf(text, sizeof text, "%u.%02x", static_cast<unsigned int>(major), static_cast<unsigned int>(minor));
+        firmware_ = text;
+        ipmiVersion_ = std::to_string(ipmiMajor) + "." + std::to_string(ipmiMinor);
+    }
     if (known && now.added == seen.added && now.erased == seen.erased)
         return true;
     ipmi_monitoring_ipmi_config cfg = ipmiConfig();

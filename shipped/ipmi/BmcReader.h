@@ -56,12 +56,17 @@ public:
     // be read.
     bool read(std::vector<Sensor>& out, std::string& error);
 
-    // The SEL records added since the last call, by the seen-state kept in
+    // The SEL records added since the last call (and the BMC's versions, on
+    // the first call that reaches it), by the seen-state kept in
     // the cache directory: the last record id with the SEL's last add and
     // erase time stamps, since record ids restart after a clear. A BMC seen
     // for the first time has its log taken as seen. False when the BMC could
     // not be asked.
     bool newEvents(std::vector<SelEvent>& out, std::string& error);
+
+    // The BMC's firmware and IPMI versions ("" until newEvents has asked).
+    std::string const& firmware() const { return firmware_; }
+    std::string const& ipmiVersion() const { return ipmiVersion_; }
 
     BmcConfig const& config() const { return config_; }
 
@@ -83,6 +88,8 @@ private:
     std::string factsFile_;
     std::time_t factsTime_ = 0;
     std::string host_; // "host:port"; unused in-band
+    std::string firmware_;
+    std::string ipmiVersion_;
 };
 
 } // namespace ipmi

@@ -274,6 +274,11 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
         IPMI_LOG(kProgress, b.label, " answers again");
     b.reachable = true;
     judge(b.bmcNode, "ok", b.label + " answers again", out);
+    Node::Property p;
+    if (!b.reader->firmware().empty() && !b.bmcNode.node->getProperty("version", &p)) {
+        b.bmcNode.node->setProperty("version", b.reader->firmware());
+        b.bmcNode.node->setProperty("ipmi_version", b.reader->ipmiVersion());
+    }
     for (Sensor const& s : sensors) {
         std::string const key = std::to_string(s.entityId) + "." + std::to_string(s.entityInstance) + "/" + s.name;
         auto it = b.sensors.find(key);
