@@ -295,6 +295,24 @@ TEST_F(IpmiTest, SelRecordRaisesOnceAcrossRestarts)
     EXPECT_EQ(alerts(bmc), std::vector<std::string>{});
 }
 
+// No /dev/ipmi0 and no configuration: loaded, no node, one information line.
+TEST_F(IpmiTest, NoBmcLoadsWithNoNodes)
+{
+    if (fs::exists("/dev/ipmi0"))
+        GTEST_SKIP() << "this machine has an in-band BMC";
+    ictest::EnvGuard none("IC_IPMI_CONFIG", tmp_.path("missing.conf"));
+    ictest::LogCapture log;
+    open();
+    std::vector<Node*> all;
+    ic_->getAllNodes(all);
+    EXPECT_EQ(all.size(), 0u);
+    std::vector<std::string> lines;
+    for (HGLog::Record const& r : log.logs("Helmgard.Plugins.IPMI"))
+        lines.push_back(std::to_string(r.level) + " " + r.message);
+    EXPECT_EQ(lines, std::vector<std::string>{"3000 no BMC: no /dev/ipmi0 and no BMC configured in " +
+                                              tmp_.path("missing.conf") + "; reporting nothing"});
+}
+
 // Bad sections are each one error line naming the file and line; the good
 // BMC still loads; a wrong password is a condition on its BMC, not a crash.
 TEST_F(IpmiTest, ConfigurationErrorsLeaveOutOnlyTheirBmc)
