@@ -204,6 +204,7 @@ TEST_F(IpmiTest, OneTreeWithLinuxhw)
 {
     fs::create_symlink(LINUXHW_PLUGIN, tmp_.path("mi/linuxhw.so"));
     ictest::EnvGuard sysfs("IC_SYSFS_ROOT", LINUXHW_EXAMPLES "/small");
+    ictest::EnvGuard poll("IC_LINUXHW_POLL_MS", "100");
     open();
     std::vector<Node*> all;
     ic_->getAllNodes(all);
@@ -219,6 +220,17 @@ TEST_F(IpmiTest, OneTreeWithLinuxhw)
                                                ic_->getNodeHierarchy(bmcChassis)}));
     EXPECT_EQ(ic_->getNodeHierarchy(byName("CPU 0 core 0")),
               "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+
+    // ipmi removed by a reload: linuxhw announces its nodes again below a
+    // ROOT and Chassis of its own, so that none is left without its parent.
+    fs::remove(tmp_.path("mi/ipmi.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return byName("System Acme Computers Edge E10") != nullptr; }, kDeadlineMs));
+    Node* core = byName("CPU 0 core 0");
+    ASSERT_NE(core, nullptr);
+    EXPECT_EQ(ic_->getNodeHierarchy(core), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+    Node* parent = nullptr;
+    EXPECT_EQ(ic_->getNode(core->getLinkedId(), &parent).getStatus(), 0);
 }
 
 // Each change made through the simulator's console raises exactly one

@@ -14,6 +14,10 @@
 // - It never keeps the other plug-in's node object: once Initialize returns
 //   that node's code may be unloaded by a reload.
 // - Its removal alerts (release included) name only its own nodes.
+// - When the adopted node goes away (the other plug-in removed by a
+//   reload), the adopter removes its nodes and announces them again below a
+//   ROOT and Chassis of its own (linuxhw does; ipmi, which loads first,
+//   does not yet).
 #pragma once
 
 #include <IC/ManagementInterface.h>

@@ -224,11 +224,52 @@ void LinuxHwMI::poll()
 {
     DeviceList const found = scanChanging();
     Outbox out;
+    IC::NodeLookupCallBack lookup = nullptr;
+    std::string sharedPath;
     {
         SD::MutexGuard g(lock_);
+        lookup = lookup_;
+        if (!adopted_.empty())
+            sharedPath = adopted_.count(kChassisKey) ? shipped::kChassisPath : shipped::kRootPath;
+    }
+    // The adopted chassis is asked after by status only: its node belongs to
+    // another plug-in, whose code may be gone. Not under our lock: the look-up
+    // takes the library's.
+    IC::Node* shared = nullptr;
+    bool const orphaned = !sharedPath.empty() && lookup && lookup(sharedPath, &shared).getStatus() != 0;
+    DeviceList fixed;
+    if (orphaned) {
+        std::set<unsigned int> packages;
+        SystemScanner(*reader_).scanFixed(fixed, packages);
+    }
+    {
+        SD::MutexGuard g(lock_);
+        if (orphaned)
+            rehome(fixed, out);
         reconcile(found, true, true, out);
     }
     deliver(out);
+}
+
+void LinuxHwMI::rehome(DeviceList const& fixed, Outbox& out)
+{
+    // Our nodes hang below a chassis the library no longer has: take them
+    // back and announce them again below a ROOT and Chassis of our own.
+    std::vector<std::string> paths;
+    for (std::string const& key : order_) {
+        Tracked& t = tracked_.at(key);
+        std::string path = t.present && t.node ? t.node->knownPath() : std::string();
+        if (!path.empty())
+            paths.push_back(std::move(path));
+        t.present = false;
+    }
+    std::string const message = "linuxhw: the shared chassis went away; reporting a chassis of its own";
+    LHW_LOG(kWarning, message);
+    if (!paths.empty())
+        out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
+                                  message);
+    adopted_.clear();
+    reconcile(fixed, false, true, out);
 }
 
 unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)

@@ -116,6 +116,8 @@ private:
     // The node's state, condition and condition_class from t.
     static void show(Tracked const& t);
     void removeMissing(std::set<std::string> const& seen, Outbox& out);
+    // The adopted ROOT/Chassis went away (its plug-in was unloaded).
+    void rehome(DeviceList const& fixed, Outbox& out);
     unsigned int claimInstance(Tracked& t, Device const& d);
     void deliver(Outbox& out);
     void stopPolling();
