@@ -5,12 +5,17 @@
 // (ipmi.so before linuxhw.so), so the first one that has anything to report
 // creates the two nodes and a later one adopts them:
 //
+// - The plug-in that reports them says so in the process-wide record of
+//   libicshipped (announceTop), and takes it back when it is released
+//   (withdrawTop).
 // - In Initialize (which runs under the library's load lock, so the other
-//   plug-in cannot be unloaded meanwhile) a plug-in looks kChassisPath (and
-//   kRootPath) up through the node look-up the library hands management
-//   interfaces. Found: it keeps only the node's id, links its top-level
-//   nodes to it and reports no ROOT or Chassis of its own. Not found: it
-//   reports its own.
+//   plug-in cannot be unloaded meanwhile) a plug-in reads the record; when
+//   it names a ROOT or Chassis, it looks kRootPath / kChassisPath up through
+//   the node look-up the library hands management interfaces, and found, it
+//   keeps only the node's id, links its top-level nodes to it and reports no
+//   ROOT or Chassis of its own. Otherwise it reports its own. (The record
+//   comes first because the library logs a look-up that finds nothing as an
+//   error, and most machines have no BMC.)
 // - It never keeps the other plug-in's node object: once Initialize returns
 //   that node's code may be unloaded by a reload.
 // - Its removal alerts (release included) name only its own nodes.
@@ -32,13 +37,25 @@ namespace shipped {
 inline std::string const kRootPath("\x1f\x5c", 2);
 inline std::string const kChassisPath("\x1f\x20\x1f\x5c", 4);
 
-// The id of the node at path that another plug-in reports, or 0 when
-// there is none (or no look-up). The first plug-in a process loads (load
-// number 1 in the upper half of its node-id base) has nothing to adopt and
-// does not ask: the library logs a look-up that finds nothing as an error.
-inline unsigned int adoptedNodeId(IC::NodeLookupCallBack lookup, unsigned int nodeIdBase, std::string const& path)
+// Node ids of the shared ROOT and Chassis and who reports them; 0: none.
+struct SharedTop {
+    unsigned int rootId = 0;
+    unsigned int chassisId = 0;
+};
+
+#define IC_SHIPPED_API __attribute__((visibility("default")))
+// Records the ROOT and Chassis a plug-in reports (0 for one it does not).
+IC_SHIPPED_API void announceTop(SharedTop const& reported);
+// Clears the record if rootId is still the recorded ROOT.
+IC_SHIPPED_API void withdrawTop(unsigned int rootId);
+IC_SHIPPED_API SharedTop sharedTop();
+
+// The id of the node at path that another plug-in reports, or 0 when there
+// is none, no look-up, or the record says nobody reports it (recorded: the
+// id the record holds).
+inline unsigned int adoptedNodeId(IC::NodeLookupCallBack lookup, unsigned int recorded, std::string const& path)
 {
-    if (!lookup || (nodeIdBase >> 16) <= 1)
+    if (!lookup || recorded == 0)
         return 0;
     IC::Node* node = nullptr;
     IC::Error const e = lookup(path, &node);

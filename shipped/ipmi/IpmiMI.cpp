@@ -152,15 +152,19 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         return ok();
     }
     // The shared top of the tree (SharedTree.h): adopt what another plug-in
-    // reports, or report it ourselves.
-    unsigned int rootId = shipped::adoptedNodeId(lookup_, base_, shipped::kRootPath);
-    unsigned int chassisId = shipped::adoptedNodeId(lookup_, base_, shipped::kChassisPath);
-    if (rootId == 0)
-        rootId = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
-    // The host's chassis too, even with out-of-band BMCs only, so that a
-    // plug-in loaded later finds the whole shared top.
-    if (chassisId == 0)
+    // reports, or report it ourselves. The host's chassis too, even with
+    // out-of-band BMCs only, so that a plug-in loaded later finds both.
+    shipped::SharedTop const top = shipped::sharedTop();
+    unsigned int rootId = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath);
+    unsigned int chassisId = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath);
+    if (rootId == 0) {
+        rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
+        if (chassisId == 0)
+            chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+        shipped::announceTop({rootId, chassisId});
+    } else if (chassisId == 0) {
         chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+    }
     std::set<unsigned int> chassisInstances{0};
     for (BmcConfig& c : configs) {
         auto b = std::make_unique<Bmc>();
@@ -365,6 +369,8 @@ IC::Error IpmiMI::shutdown()
 void IpmiMI::release()
 {
     stop();
+    if (ownRootId_ != 0)
+        shipped::withdrawTop(ownRootId_);
     // The library keeps pointers to our nodes, whose code leaves with us.
     std::vector<std::string> paths;
     for (auto const& n : nodes_) {

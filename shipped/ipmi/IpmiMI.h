@@ -93,6 +93,7 @@ private:
     bool mapped_ = false;  // getMap has handed the nodes over: later ones are arrivals
     bool stopping_ = false;
     unsigned int passes_ = 0;
+    unsigned int ownRootId_ = 0; // the shared ROOT when we report it
     std::vector<Node*> order_; // nodes in the order made: parents first
     std::vector<std::unique_ptr<Node>> nodes_;
     std::vector<std::unique_ptr<Bmc>> bmcs_;

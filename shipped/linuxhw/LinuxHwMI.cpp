@@ -119,9 +119,10 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         reader_ = std::make_unique<SysfsReader>(root);
         // The shared top of the tree (SharedTree.h): what another plug-in
         // already reports is adopted by id, not reported again.
-        if (unsigned int const id = shipped::adoptedNodeId(lookup_, base_, shipped::kRootPath))
+        shipped::SharedTop const top = shipped::sharedTop();
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath))
             adopted_[kRootKey] = id;
-        if (unsigned int const id = shipped::adoptedNodeId(lookup_, base_, shipped::kChassisPath))
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath))
             adopted_[kChassisKey] = id;
     }
     if (!reader_->isDirectory("sys") && !reader_->isDirectory("proc"))
@@ -140,6 +141,7 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     SD::MutexGuard g(lock_);
     reconcile(fixed, false, false, unused);
     reconcile(changing, true, false, unused);
+    announceOwnTop();
     LHW_LOG(kProgress, "reporting ", order_.size(), " nodes from ", reader_->root(),
             ", polling every ", pollMs_, " ms");
     return ok();
@@ -173,6 +175,8 @@ void LinuxHwMI::release()
 {
     // A reload releases without shutdown(); the thread must not outlive us.
     stopPolling();
+    if (ownRootId_ != 0)
+        shipped::withdrawTop(ownRootId_);
     // The library keeps pointers to our nodes, and their code leaves with
     // this library: have it forget them first, with one removal naming all.
     std::vector<std::string> paths;
@@ -224,19 +228,14 @@ void LinuxHwMI::poll()
 {
     DeviceList const found = scanChanging();
     Outbox out;
-    IC::NodeLookupCallBack lookup = nullptr;
-    std::string sharedPath;
+    // The adopted ROOT is gone once the plug-in that reported it withdrew it
+    // (it was released); its node is never touched from here.
+    bool orphaned = false;
     {
         SD::MutexGuard g(lock_);
-        lookup = lookup_;
-        if (!adopted_.empty())
-            sharedPath = adopted_.count(kChassisKey) ? shipped::kChassisPath : shipped::kRootPath;
+        auto const root = adopted_.find(kRootKey);
+        orphaned = root != adopted_.end() && shipped::sharedTop().rootId != root->second;
     }
-    // The adopted chassis is asked after by status only: its node belongs to
-    // another plug-in, whose code may be gone. Not under our lock: the look-up
-    // takes the library's.
-    IC::Node* shared = nullptr;
-    bool const orphaned = !sharedPath.empty() && lookup && lookup(sharedPath, &shared).getStatus() != 0;
     DeviceList fixed;
     if (orphaned) {
         std::set<unsigned int> packages;
@@ -270,6 +269,17 @@ void LinuxHwMI::rehome(DeviceList const& fixed, Outbox& out)
                                   message);
     adopted_.clear();
     reconcile(fixed, false, true, out);
+    announceOwnTop();
+}
+
+void LinuxHwMI::announceOwnTop()
+{
+    auto const id = [this](std::string const& key) {
+        auto const t = tracked_.find(key);
+        return t != tracked_.end() && t->second.present && t->second.node ? t->second.node->getNodeId() : 0u;
+    };
+    if (adopted_.count(kRootKey) == 0 && (ownRootId_ = id(kRootKey)) != 0)
+        shipped::announceTop({ownRootId_, id(kChassisKey)});
 }
 
 unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)

@@ -118,6 +118,8 @@ private:
     void removeMissing(std::set<std::string> const& seen, Outbox& out);
     // The adopted ROOT/Chassis went away (its plug-in was unloaded).
     void rehome(DeviceList const& fixed, Outbox& out);
+    // Records the ROOT and Chassis we report for the plug-ins loaded later.
+    void announceOwnTop();
     unsigned int claimInstance(Tracked& t, Device const& d);
     void deliver(Outbox& out);
     void stopPolling();
@@ -139,6 +141,7 @@ private:
     // its node, set in Initialize (see shipped/common/SharedTree.h).
     std::map<std::string, unsigned int> adopted_;
     IC::NodeLookupCallBack lookup_ = nullptr;
+    unsigned int ownRootId_ = 0; // the shared ROOT when we report it
 
     // Set before the polling thread starts, fixed afterwards.
     IC::AlertCallBack alertCB_ = nullptr;
