@@ -17,6 +17,7 @@ packages=(
   libbenchmark-dev
   libcpp-httplib-dev libssl-dev libcrypt-dev
   dpkg-dev curl jq
+  openipmi freeipmi-tools libipmimonitoring-dev libfreeipmi-dev
 )
 optional=(chromium chromium-driver)
 

@@ -11,17 +11,21 @@
 #   scripts/run.sh --serve         build and install, then run icd in the
 #                                  foreground (ICD_LISTEN, default
 #                                  127.0.0.1:9847) until Ctrl-C
+#   scripts/run.sh --example bmc   the small server with a simulated BMC
+#                                  (examples/bmc, ipmi_sim on 127.0.0.1) as an
+#                                  out-of-band BMC of the ipmi plug-in
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 example=""
 serve=0
+cleanup=""
 watch_seconds=${IC_WATCH_SECONDS:-5}
 while [[ $# -gt 0 ]]; do
   case "$1" in
-    --example) example=${2:?--example needs small, large, degraded or hostile}; shift 2 ;;
+    --example) example=${2:?--example needs small, large, degraded, hostile or bmc}; shift 2 ;;
     --serve) serve=1; shift ;;
-    *) echo "usage: $0 [--example small|large|degraded|hostile] [--serve]" >&2; exit 2 ;;
+    *) echo "usage: $0 [--example small|large|degraded|hostile|bmc] [--serve]" >&2; exit 2 ;;
   esac
 done
 
@@ -39,6 +43,26 @@ if [[ "$example" == hostile ]]; then
   examples/sysfs/make-hostile.sh build/examples/hostile >/dev/null
   icctl+=(--sysfs-root build/examples/hostile)
   icd+=(--sysfs-root build/examples/hostile)
+elif [[ "$example" == bmc ]]; then
+  # The simulator on loopback with its own state and ports, stopped on exit.
+  sim="$PWD/build/examples/bmc"
+  rm -rf "$sim" && mkdir -p "$sim/state"
+  lan=${IC_BMC_PORT:-16230}
+  cleanup='examples/bmc/bmcsim.sh stop "$sim/state"'
+  trap "$cleanup" EXIT
+  examples/bmc/bmcsim.sh start "$sim/state" "$lan" $((lan + 1))
+  printf 'icbmc-secret\n' >"$sim/pw" && chmod 600 "$sim/pw"
+  cat >"$sim/ipmi.conf" <<EOF
+[bmc example]                 # the simulated BMC of examples/bmc
+host = 127.0.0.1:$lan
+user = monitor
+password_file = $sim/pw
+privilege = operator
+workarounds = opensesspriv    # ipmi_sim needs it
+EOF
+  export IC_IPMI_CONFIG="$sim/ipmi.conf"
+  icctl+=(--sysfs-root examples/sysfs/small)
+  icd+=(--sysfs-root examples/sysfs/small)
 elif [[ -n "$example" ]]; then
   icctl+=(--sysfs-root "examples/sysfs/$example")
   icd+=(--sysfs-root "examples/sysfs/$example")
@@ -47,11 +71,17 @@ fi
 if [[ $serve -eq 1 ]]; then
   listen=${ICD_LISTEN:-127.0.0.1:9847}
   echo "=== icd, until Ctrl-C: the page at /, /metrics, /api/v1/nodes ==="
-  exec "${icd[@]}" --listen "$listen"
+  "${icd[@]}" --listen "$listen"
+  exit
 fi
 
 echo "=== icctl tree ==="
 "${icctl[@]}" tree
+if [[ "$example" == bmc ]]; then
+  echo
+  echo "=== icctl alerts ==="
+  "${icctl[@]}" alerts
+fi
 echo
 echo "=== icctl watch (${watch_seconds} s) ==="
 "${icctl[@]}" watch --for "$watch_seconds"
@@ -59,7 +89,7 @@ echo "=== icctl watch (${watch_seconds} s) ==="
 echo
 echo "=== icd: one scrape ==="
 source scripts/icd-lib.sh
-trap icd_stop_quietly EXIT
+trap "icd_stop_quietly; ${cleanup:-}" EXIT
 icd_start build/icd.log "${icd[@]}"
 curl -fsS --max-time 10 -o build/icd-metrics.txt "$icd_url/metrics"
 echo "icd answered at $icd_url/ (page), $icd_url/metrics, $icd_url/api/v1/nodes"

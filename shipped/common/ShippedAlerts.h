@@ -1,6 +1,8 @@
 // Alert classes, severities and statuses raised by the shipped plug-ins
-// (the Linux hardware management interface and the health functional
-// plug-in), and read by icctl.
+// (the Linux hardware and IPMI management interfaces and the health
+// functional plug-in), and read by icctl. ipmi raises classes 3, 4 and 5
+// as linuxhw does, for the BMC's sensors and for the BMC itself (status 3
+// while it does not answer).
 //
 // Classes 3 and 4 have the meaning the library gives them (node arrival,
 // node removal); class 5 is what simple-alert subscribers see as event 1.
@@ -17,6 +19,10 @@
 //                                      when the link is back
 //   8      health-rollup    health     the worst asserted severity below the chassis, on
 //                                      the chassis node (status 1 when all is well)
+//   9      event-log        ipmi       a new record of a BMC's event log (SEL), on the
+//                                      BMC's node, severity from FreeIPMI's reading of
+//                                      the event; status 1: a record is history, it
+//                                      asserts nothing
 //
 // Severities: 0 information, 1 warning, 2 critical, 3 fatal.
 // Status: 1 normal (clears the path's asserted alert); 2 warning; 3 critical.
@@ -44,6 +50,7 @@ constexpr IC::Alert::ClassType kThreshold = static_cast<IC::Alert::ClassType>(5)
 constexpr IC::Alert::ClassType kMemoryErrors = static_cast<IC::Alert::ClassType>(6);
 constexpr IC::Alert::ClassType kLink = static_cast<IC::Alert::ClassType>(7);
 constexpr IC::Alert::ClassType kHealthRollup = static_cast<IC::Alert::ClassType>(8);
+constexpr IC::Alert::ClassType kEventLog = static_cast<IC::Alert::ClassType>(9);
 
 constexpr unsigned char kSeverityInfo = 0;
 constexpr unsigned char kSeverityWarning = 1;
@@ -88,6 +95,24 @@ inline bool conditionOf(IC::Node const& node, std::vector<IC::Alert>& out)
     return true;
 }
 
+// Shows on node the state and the condition its interface has asserted
+// (status raised, class cls, message; status 1: none), changing only what
+// differs.
+inline void showCondition(IC::Node& node, std::string const& state, unsigned int raised,
+                          IC::Alert::ClassType cls, std::string const& message)
+{
+    IC::Node::Property p;
+    if (!node.getProperty("state", &p) || p.value != state)
+        node.setProperty("state", state);
+    if (raised == kStatusNormal) {
+        node.removeProperty(kConditionProperty);
+        node.removeProperty(kConditionClassProperty);
+    } else if (!node.getProperty(kConditionProperty, &p) || p.value != message) {
+        node.setProperty(kConditionProperty, message);
+        node.setProperty(kConditionClassProperty, std::to_string(cls));
+    }
+}
+
 // A short name of a class for people ("threshold"); "class N" for others.
 inline char const* className(unsigned int cls)
 {
@@ -98,6 +123,7 @@ inline char const* className(unsigned int cls)
     case 6: return "memory-errors";
     case 7: return "link";
     case 8: return "health-rollup";
+    case 9: return "event-log";
     default: return nullptr;
     }
 }

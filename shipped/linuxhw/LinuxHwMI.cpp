@@ -3,6 +3,8 @@
 #include "DeviceScanner.h"
 #include "HwmonScanner.h"
 #include "Log.h"
+#include "SharedTree.h"
+#include "OpenShippedMI.h"
 #include "ShippedAlerts.h"
 #include "SystemScanner.h"
 
@@ -86,11 +88,12 @@ LinuxHwMI::~LinuxHwMI()
 }
 
 void LinuxHwMI::registerNodeCallBacks(IC::NodeArrivalCallBack arrival, void const* context,
-                                      IC::NodeLookupCallBack)
+                                      IC::NodeLookupCallBack lookup)
 {
     SD::MutexGuard g(lock_);
     arrivalCB_ = arrival;
     arrivalContext_ = context;
+    lookup_ = lookup;
 }
 
 IC::Error LinuxHwMI::registerForAlerts(IC::AlertCallBack callback, void const* context)
@@ -114,6 +117,13 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         base_ = nodeIdBase & 0xFFFF0000u;
         pollMs_ = ms;
         reader_ = std::make_unique<SysfsReader>(root);
+        // The shared top of the tree (SharedTree.h): what another plug-in
+        // already reports is adopted by id, not reported again.
+        shipped::SharedTop const top = shipped::sharedTop();
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath))
+            adopted_[kRootKey] = id;
+        if (unsigned int const id = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath))
+            adopted_[kChassisKey] = id;
     }
     if (!reader_->isDirectory("sys") && !reader_->isDirectory("proc"))
         LHW_LOG(kError, "no sys or proc directory below ", reader_->root(),
@@ -131,6 +141,7 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     SD::MutexGuard g(lock_);
     reconcile(fixed, false, false, unused);
     reconcile(changing, true, false, unused);
+    announceOwnTop();
     LHW_LOG(kProgress, "reporting ", order_.size(), " nodes from ", reader_->root(),
             ", polling every ", pollMs_, " ms");
     return ok();
@@ -164,6 +175,8 @@ void LinuxHwMI::release()
 {
     // A reload releases without shutdown(); the thread must not outlive us.
     stopPolling();
+    if (ownRootId_ != 0)
+        shipped::withdrawTop(ownRootId_);
     // The library keeps pointers to our nodes, and their code leaves with
     // this library: have it forget them first, with one removal naming all.
     std::vector<std::string> paths;
@@ -215,11 +228,58 @@ void LinuxHwMI::poll()
 {
     DeviceList const found = scanChanging();
     Outbox out;
+    // The adopted ROOT is gone once the plug-in that reported it withdrew it
+    // (it was released); its node is never touched from here.
+    bool orphaned = false;
     {
         SD::MutexGuard g(lock_);
+        auto const root = adopted_.find(kRootKey);
+        orphaned = root != adopted_.end() && shipped::sharedTop().rootId != root->second;
+    }
+    DeviceList fixed;
+    if (orphaned) {
+        std::set<unsigned int> packages;
+        SystemScanner(*reader_).scanFixed(fixed, packages);
+    }
+    {
+        SD::MutexGuard g(lock_);
+        if (orphaned)
+            rehome(fixed, out);
         reconcile(found, true, true, out);
     }
     deliver(out);
+}
+
+void LinuxHwMI::rehome(DeviceList const& fixed, Outbox& out)
+{
+    // Our nodes hang below a chassis the library no longer has: take them
+    // back and announce them again below a ROOT and Chassis of our own.
+    std::vector<std::string> paths;
+    for (std::string const& key : order_) {
+        Tracked& t = tracked_.at(key);
+        std::string path = t.present && t.node ? t.node->knownPath() : std::string();
+        if (!path.empty())
+            paths.push_back(std::move(path));
+        t.present = false;
+    }
+    std::string const message = "linuxhw: the shared chassis went away; reporting a chassis of its own";
+    LHW_LOG(kWarning, message);
+    if (!paths.empty())
+        out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
+                                  message);
+    adopted_.clear();
+    reconcile(fixed, false, true, out);
+    announceOwnTop();
+}
+
+void LinuxHwMI::announceOwnTop()
+{
+    auto const id = [this](std::string const& key) {
+        auto const t = tracked_.find(key);
+        return t != tracked_.end() && t->second.present && t->second.node ? t->second.node->getNodeId() : 0u;
+    };
+    if (adopted_.count(kRootKey) == 0 && (ownRootId_ = id(kRootKey)) != 0)
+        shipped::announceTop({ownRootId_, id(kChassisKey)});
 }
 
 unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)
@@ -246,7 +306,7 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
     std::set<std::string> seen;
     std::size_t leftOut = 0;
     for (Device const& d : found) {
-        if (!seen.insert(d.key).second)
+        if (!seen.insert(d.key).second || adopted_.count(d.key) != 0)
             continue; // two entries of one identity: the first one counts
         auto it = tracked_.find(d.key);
         if (it != tracked_.end() && it->second.present) {
@@ -254,7 +314,9 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
             continue;
         }
         unsigned int parentId = 0;
-        if (!d.parentKey.empty()) {
+        if (auto const adopted = adopted_.find(d.parentKey); adopted != adopted_.end()) {
+            parentId = adopted->second;
+        } else if (!d.parentKey.empty()) {
             auto const parent = tracked_.find(d.parentKey);
             if (parent == tracked_.end() || !parent->second.present || !parent->second.node) {
                 LHW_LOG(kWarning, d.description, " left out: its parent ", d.parentKey,
@@ -495,16 +557,5 @@ void LinuxHwMI::deliver(Outbox& out)
 extern "C" __attribute__((visibility("default"))) unsigned char
 OpenMI(IC::ManagementInterface** mi, IC::Error** err)
 {
-    static IC::Error good(0, IC::Number(IC::Number::Generic), std::string());
-    static IC::Error bad(1, IC::Number(IC::Number::Generic), "linuxhw: out of memory");
-    if (!mi || !err)
-        return 1;
-    try {
-        *mi = new linuxhw::LinuxHwMI();
-    } catch (...) {
-        *err = &bad;
-        return 1;
-    }
-    *err = &good;
-    return 0;
+    return shipped::openMI<linuxhw::LinuxHwMI>(mi, err, "linuxhw");
 }

@@ -116,6 +116,10 @@ private:
     // The node's state, condition and condition_class from t.
     static void show(Tracked const& t);
     void removeMissing(std::set<std::string> const& seen, Outbox& out);
+    // The adopted ROOT/Chassis went away (its plug-in was unloaded).
+    void rehome(DeviceList const& fixed, Outbox& out);
+    // Records the ROOT and Chassis we report for the plug-ins loaded later.
+    void announceOwnTop();
     unsigned int claimInstance(Tracked& t, Device const& d);
     void deliver(Outbox& out);
     void stopPolling();
@@ -133,6 +137,11 @@ private:
     std::map<std::tuple<std::string, unsigned int, unsigned int>, std::string> claims_;
     // Every node ever handed out: the library may hold them until release().
     std::vector<std::unique_ptr<HwNode>> nodes_;
+    // Keys of ROOT and Chassis when another plug-in reports them: the id of
+    // its node, set in Initialize (see shipped/common/SharedTree.h).
+    std::map<std::string, unsigned int> adopted_;
+    IC::NodeLookupCallBack lookup_ = nullptr;
+    unsigned int ownRootId_ = 0; // the shared ROOT when we report it
 
     // Set before the polling thread starts, fixed afterwards.
     IC::AlertCallBack alertCB_ = nullptr;

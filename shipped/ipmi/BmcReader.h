@@ -1,0 +1,95 @@
+// BmcReader: one pass over the sensors of one BMC, through FreeIPMI's
+// libipmimonitoring (readings, units, discrete states) and the SDR cache it
+// keeps in the data directory, read with libfreeipmi (entity id and
+// instance, thresholds). The in-band BMC and the out-of-band ones share
+// everything but the connection settings. Used by one thread at a time.
+#pragma once
+
+#include "IpmiConfig.h"
+
+#include <ipmi_monitoring.h>
+#include <ipmi_monitoring_bitmasks.h>
+
+#include <array>
+#include <ctime>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace ipmi {
+
+struct Sensor {
+    std::string name;
+    int type = 0;              // IPMI sensor type
+    unsigned int entityId = 0; // from the SDR; 0 when unknown
+    unsigned int entityInstance = 0;
+    bool thresholdBased = false; // judged by thresholds, so it has a reading
+    std::optional<double> reading;
+    std::string unit;
+    // lower_critical, lower_warning, upper_warning, upper_critical
+    std::array<std::optional<double>, 4> thresholds;
+    std::string state; // ok, warning, critical, unknown
+    std::string event; // FreeIPMI's words for what the sensor says
+};
+
+// A new record of the BMC's event log (SEL).
+struct SelEvent {
+    unsigned int id = 0;
+    std::string sensor; // the sensor's name; "" when the record names none
+    std::string text;
+    int state = 0; // IPMI_MONITORING_STATE_*
+};
+
+class BmcReader {
+public:
+    // The session time-out: a BMC that does not answer fails a pass after
+    // about this long.
+    static constexpr int kSessionTimeoutMs = 2000;
+
+    BmcReader(BmcConfig config, std::string cacheDir);
+    ~BmcReader();
+    BmcReader(BmcReader const&) = delete;
+    BmcReader& operator=(BmcReader const&) = delete;
+
+    // Every sensor, in SDR order; false with error set when the BMC could not
+    // be read.
+    bool read(std::vector<Sensor>& out, std::string& error);
+
+    // The SEL records added since the last call (and the BMC's versions, on
+    // the first call that reaches it), by the seen-state kept in
+    // the cache directory: the last record id with the SEL's last add and
+    // erase time stamps, since record ids restart after a clear. A BMC seen
+    // for the first time has its log taken as seen. False when the BMC could
+    // not be asked.
+    bool newEvents(std::vector<SelEvent>& out, std::string& error);
+
+    // The BMC's firmware and IPMI versions ("" until newEvents has asked).
+    std::string const& firmware() const { return firmware_; }
+    std::string const& ipmiVersion() const { return ipmiVersion_; }
+
+    BmcConfig const& config() const { return config_; }
+
+private:
+    struct SdrFacts {
+        unsigned int entityId = 0;
+        unsigned int entityInstance = 0;
+        bool sensor = false; // a sensor record, not a locator or OEM one
+        std::array<std::optional<double>, 4> thresholds;
+    };
+    void loadSdrFacts();
+    ipmi_monitoring_ipmi_config ipmiConfig() const;
+    char const* hostname() const;
+
+    BmcConfig const config_;
+    std::string const cacheDir_;
+    ipmi_monitoring_ctx_t ctx_ = nullptr;
+    std::map<int, SdrFacts> facts_; // by SDR record id, for this cache file
+    std::string factsFile_;
+    std::time_t factsTime_ = 0;
+    std::string host_; // "host:port"; unused in-band
+    std::string firmware_;
+    std::string ipmiVersion_;
+};
+
+} // namespace ipmi

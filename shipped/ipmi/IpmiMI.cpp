@@ -1,0 +1,394 @@
+#include "IpmiMI.h"
+
+#include "IpmiConfig.h"
+#include "Log.h"
+#include "SharedTree.h"
+#include "OpenShippedMI.h"
+#include "ShippedAlerts.h"
+
+#include <SD/PlatformUtilities.h>
+
+#include <sys/stat.h>
+
+#include <cstdio>
+#include <filesystem>
+#include <cstdlib>
+
+#ifndef IC_IPMI_DEFAULT_CONFIG
+#define IC_IPMI_DEFAULT_CONFIG "/etc/instrumentationcontrol/ipmi.conf"
+#endif
+
+namespace ipmi {
+
+namespace {
+
+using IC::Node;
+
+IC::Error ok()
+{
+    return IC::Error(0, IC::Number(IC::Number::Generic), std::string());
+}
+
+// FNV-1a folded to 16 bits: short instances that do not move when others
+// come and go.
+unsigned int digest(std::string const& s)
+{
+    std::uint32_t h = 2166136261u;
+    for (unsigned char c : s)
+        h = (h ^ c) * 16777619u;
+    return (h >> 16) ^ (h & 0xFFFF);
+}
+
+// The node type nearest to an IPMI sensor type (README.md has the table).
+Node::SensorType typeOf(int ipmiType)
+{
+    switch (ipmiType) {
+    case IPMI_MONITORING_SENSOR_TYPE_TEMPERATURE: return Node::TemperatureSensor;
+    case IPMI_MONITORING_SENSOR_TYPE_VOLTAGE:
+    case IPMI_MONITORING_SENSOR_TYPE_CURRENT: return Node::VoltageSensor;
+    case IPMI_MONITORING_SENSOR_TYPE_FAN:
+    case IPMI_MONITORING_SENSOR_TYPE_COOLING_DEVICE: return Node::Fan;
+    case IPMI_MONITORING_SENSOR_TYPE_PHYSICAL_SECURITY: return Node::Intrusion;
+    case IPMI_MONITORING_SENSOR_TYPE_PROCESSOR: return Node::CPU;
+    case IPMI_MONITORING_SENSOR_TYPE_POWER_SUPPLY:
+    case IPMI_MONITORING_SENSOR_TYPE_POWER_UNIT: return Node::PowerSupply;
+    case IPMI_MONITORING_SENSOR_TYPE_MEMORY: return Node::DIMM;
+    case IPMI_MONITORING_SENSOR_TYPE_DRIVE_SLOT: return Node::DriveSlotSensor;
+    case IPMI_MONITORING_SENSOR_TYPE_SYSTEM_FIRMWARE_PROGRESS: return Node::BIOS;
+    case IPMI_MONITORING_SENSOR_TYPE_EVENT_LOGGING_DISABLED: return Node::Log;
+    case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG1:
+    case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG2: return Node::BMC;
+    default: return Node::PFASensor;
+    }
+}
+
+std::string number(double v)
+{
+    char text[64];
+    std::snprintf(text, sizeof text, "%.2f", v);
+    return text;
+}
+
+unsigned int statusOf(std::string const& state)
+{
+    return state == "critical" ? shipped::kStatusCritical
+           : state == "warning" ? shipped::kStatusWarning
+                                : shipped::kStatusNormal;
+}
+
+unsigned int pollInterval()
+{
+    char const* text = std::getenv("IC_IPMI_POLL_MS");
+    if (!text || !*text)
+        return 10000;
+    char* end = nullptr;
+    unsigned long const ms = std::strtoul(text, &end, 10);
+    if (*end || ms < 100 || ms > 3600000) {
+        IPMI_LOG(kWarning, "IC_IPMI_POLL_MS='", text, "' is not 100..3600000; polling every 10000 ms");
+        return 10000;
+    }
+    return static_cast<unsigned int>(ms);
+}
+
+} // namespace
+
+IpmiMI::IpmiMI() = default;
+
+IpmiMI::~IpmiMI()
+{
+    stop();
+}
+
+void IpmiMI::registerNodeCallBacks(IC::NodeArrivalCallBack arrival, void const* context,
+                                   IC::NodeLookupCallBack lookup)
+{
+    std::lock_guard<std::mutex> g(lock_);
+    arrivalCB_ = arrival;
+    arrivalContext_ = context;
+    lookup_ = lookup;
+}
+
+IC::Error IpmiMI::registerForAlerts(IC::AlertCallBack callback, void const* context)
+{
+    std::lock_guard<std::mutex> g(lock_);
+    alertCB_ = callback;
+    alertContext_ = context;
+    return ok();
+}
+
+IpmiMI::Node* IpmiMI::newNode(Node::SensorType type, unsigned int instance, unsigned int parent,
+                              std::string const& desc)
+{
+    unsigned int const id = base_ | (nextNumber_++ & 0xFFFF);
+    nodes_.push_back(std::make_unique<Node>(type, instance, id, parent, desc, id));
+    order_.push_back(nodes_.back().get());
+    return nodes_.back().get();
+}
+
+IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
+{
+    char const* env = std::getenv("IC_IPMI_CONFIG");
+    std::string const configPath = env && *env ? env : IC_IPMI_DEFAULT_CONFIG;
+    std::vector<BmcConfig> configs = readConfig(configPath);
+    struct stat st {};
+    bool const inBand = ::stat("/dev/ipmi0", &st) == 0 && S_ISCHR(st.st_mode);
+    if (inBand)
+        configs.insert(configs.begin(), BmcConfig());
+    std::string const dataDir = SD::PlatformUtilities::getBriscaDataDir() + "/ipmi";
+    std::error_code ec;
+    std::filesystem::create_directories(dataDir, ec);
+    if (ec)
+        IPMI_LOG(kError, "cannot make ", dataDir, " (", ec.message(), "): no SDR cache, no SEL seen-state");
+
+    std::unique_lock<std::mutex> g(lock_);
+    if (initialized_)
+        return IC::Error(1, IC::Number(IC::Number::Generic), "ipmi: initialised twice");
+    initialized_ = true;
+    base_ = nodeIdBase & 0xFFFF0000u;
+    pollMs_ = pollInterval();
+    if (configs.empty()) {
+        IPMI_LOG(kProgress, "no BMC: no /dev/ipmi0 and no BMC configured in ", configPath,
+                 "; reporting nothing");
+        return ok();
+    }
+    // The shared top of the tree (SharedTree.h): adopt what another plug-in
+    // reports, or report it ourselves. The host's chassis too, even with
+    // out-of-band BMCs only, so that a plug-in loaded later finds both.
+    shipped::SharedTop const top = shipped::sharedTop();
+    unsigned int rootId = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath);
+    unsigned int chassisId = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath);
+    if (rootId == 0) {
+        rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
+        if (chassisId == 0)
+            chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+        shipped::announceTop({rootId, chassisId});
+    } else if (chassisId == 0) {
+        chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+    }
+    std::set<unsigned int> chassisInstances{0};
+    for (BmcConfig& c : configs) {
+        auto b = std::make_unique<Bmc>();
+        bool const local = c.name.empty();
+        b->label = local ? "in-band BMC" : "BMC " + c.name + " (" + c.host + ":" + std::to_string(c.port) + ")";
+        std::string const dir = dataDir + "/" + (local ? std::string("local") : std::to_string(digest(c.name)));
+        if (local) {
+            b->parentId = chassisId;
+        } else {
+            unsigned int instance = digest(c.name);
+            while (!chassisInstances.insert(instance).second)
+                instance = (instance + 1) & 0xFFFF;
+            b->chassis = newNode(Node::Chassis, instance, rootId, "Chassis of " + b->label);
+            b->parentId = b->chassis->getNodeId();
+        }
+        b->bmcNode.node = newNode(Node::BMC, 0, b->parentId, b->label);
+        b->bmcNode.node->setProperty("host", local ? "/dev/ipmi0" : c.host + ":" + std::to_string(c.port));
+        b->reader = std::make_unique<BmcReader>(std::move(c), dir);
+        bmcs_.push_back(std::move(b));
+    }
+    thread_ = std::thread([this] { run(); });
+    // Open waits for one pass, but not for a BMC that does not answer.
+    if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return passes_ > 0; }))
+        IPMI_LOG(kWarning, "the BMCs did not all answer within ", kOpenWaitMs,
+                 " ms; their sensors are reported when they do");
+    IPMI_LOG(kProgress, "reporting ", order_.size(), " nodes from ", bmcs_.size(), " BMCs, polling every ",
+             pollMs_, " ms");
+    return ok();
+}
+
+IC::Error IpmiMI::getMap(std::vector<IC::Node*>& nodes)
+{
+    std::lock_guard<std::mutex> g(lock_);
+    nodes.insert(nodes.end(), order_.begin(), order_.end());
+    mapped_ = true;
+    return ok();
+}
+
+void IpmiMI::run()
+{
+    std::unique_lock<std::mutex> g(lock_);
+    while (!stopping_) {
+        g.unlock();
+        pass();
+        g.lock();
+        ++passes_;
+        wake_.notify_all();
+        wake_.wait_for(g, std::chrono::milliseconds(pollMs_), [this] { return stopping_; });
+    }
+}
+
+void IpmiMI::pass()
+{
+    // bmcs_ is fixed once the thread runs; each BMC's reader is this thread's.
+    for (auto& b : bmcs_) {
+        if (std::chrono::steady_clock::now() < b->nextTry)
+            continue;
+        Outbox out;
+        readBmc(*b, out);
+        deliver(out);
+        std::lock_guard<std::mutex> g(lock_);
+        if (stopping_)
+            return;
+    }
+}
+
+void IpmiMI::judge(Tracked& t, std::string const& state, std::string const& message, Outbox& out)
+{
+    t.state = state;
+    unsigned int const status = statusOf(state);
+    std::string const path = t.node->knownPath();
+    // Unknown keeps the condition last reported; before the library has the
+    // node (no path) a condition is only shown, for health to assert.
+    if (state != "unknown" && status != t.raised) {
+        t.raised = status;
+        t.message = message;
+        if (mapped_ && !path.empty()) {
+            out.alerts.emplace_back(shipped::severityOf(status), shipped::kThreshold,
+                                    std::vector<std::string>{path}, status, message);
+            IPMI_LOG(status == shipped::kStatusNormal ? kProgress : kWarning, "alert: ", message);
+        }
+    }
+    shipped::showCondition(*t.node, state, t.raised, shipped::kThreshold, t.message);
+}
+
+void IpmiMI::readBmc(Bmc& b, Outbox& out)
+{
+    std::vector<Sensor> sensors;
+    std::vector<SelEvent> events;
+    std::string error, selError;
+    bool const answered = b.reader->read(sensors, error);
+    if (answered && !b.reader->newEvents(events, selError))
+        IPMI_LOG(kWarning, b.label, ": the event log could not be read: ", selError);
+    std::lock_guard<std::mutex> g(lock_);
+    if (!answered) {
+        ++b.failures;
+        // Back off: 2, 4, then 8 intervals between tries while it is away.
+        b.nextTry = std::chrono::steady_clock::now() +
+                    std::chrono::milliseconds(pollMs_) * ((1u << std::min(b.failures, 3u)) - 1);
+        if (b.reachable || b.failures == 1)
+            IPMI_LOG(kError, b.label, " does not answer: ", error);
+        b.reachable = false;
+        judge(b.bmcNode, "critical", b.label + " is unreachable: " + error, out);
+        for (auto& s : b.sensors)
+            judge(s.second, "unknown", s.second.message, out);
+        return;
+    }
+    b.failures = 0;
+    b.nextTry = {};
+    if (!b.reachable)
+        IPMI_LOG(kProgress, b.label, " answers again");
+    b.reachable = true;
+    judge(b.bmcNode, "ok", b.label + " answers again", out);
+    Node::Property p;
+    if (!b.reader->firmware().empty() && !b.bmcNode.node->getProperty("version", &p)) {
+        b.bmcNode.node->setProperty("version", b.reader->firmware());
+        b.bmcNode.node->setProperty("ipmi_version", b.reader->ipmiVersion());
+    }
+    for (Sensor const& s : sensors) {
+        std::string const key = std::to_string(s.entityId) + "." + std::to_string(s.entityInstance) + "/" + s.name;
+        auto it = b.sensors.find(key);
+        if (it == b.sensors.end()) {
+            Node::SensorType const type = typeOf(s.type);
+            // Identity from facts that survive restarts and SDR reorders:
+            // entity id, entity instance and name, never the record id.
+            unsigned int instance = digest(key);
+            while (!b.instances.emplace(type, instance).second)
+                ++instance;
+            it = b.sensors.emplace(key, Tracked()).first;
+            it->second.node = newNode(type, instance, b.parentId, s.name);
+            it->second.node->setProperty("entity", std::to_string(s.entityId) + "." + std::to_string(s.entityInstance));
+            if (mapped_)
+                out.arrivals.push_back(it->second.node);
+        }
+        Node& n = *it->second.node;
+        if (s.reading || s.thresholdBased)
+            n.setProperty("reading", s.reading ? number(*s.reading) : "unknown", s.unit);
+        static char const* const names[4] = {"lower_critical", "lower_warning", "upper_warning", "upper_critical"};
+        for (int k = 0; k < 4; ++k)
+            if (s.thresholds[k])
+                n.setProperty(names[k], number(*s.thresholds[k]), s.unit);
+        if (!s.event.empty())
+            n.setProperty("event", s.event);
+        std::string const message = b.label + " " + s.name + " " +
+                                    (s.reading ? number(*s.reading) + (s.unit.empty() ? "" : " " + s.unit) + " " : "") +
+                                    s.state + (s.event.empty() ? "" : ": " + s.event);
+        judge(it->second, s.state, message, out);
+    }
+    std::string const bmcPath = b.bmcNode.node->knownPath();
+    for (SelEvent const& e : events) {
+        unsigned char const severity = e.state == IPMI_MONITORING_STATE_CRITICAL  ? shipped::kSeverityCritical
+                                       : e.state == IPMI_MONITORING_STATE_WARNING ? shipped::kSeverityWarning
+                                                                                  : shipped::kSeverityInfo;
+        IPMI_LOG(severity == shipped::kSeverityInfo ? kProgress : kWarning, b.label, " ", e.text);
+        if (!bmcPath.empty())
+            out.alerts.emplace_back(severity, shipped::kEventLog, std::vector<std::string>{bmcPath},
+                                    shipped::kStatusNormal, b.label + " " + e.text);
+    }
+}
+
+void IpmiMI::deliver(Outbox& out)
+{
+    IC::NodeArrivalCallBack arrival;
+    IC::AlertCallBack alert;
+    void const *arrivalContext, *alertContext;
+    {
+        std::lock_guard<std::mutex> g(lock_);
+        arrival = arrivalCB_;
+        alert = alertCB_;
+        arrivalContext = arrivalContext_;
+        alertContext = alertContext_;
+    }
+    for (Node* n : out.arrivals) {
+        if (!arrival)
+            break;
+        arrival(n, arrivalContext);
+        // What was wrong with it is told once it has a path.
+        if (shipped::conditionOf(*n, out.alerts))
+            IPMI_LOG(kWarning, "alert: ", out.alerts.back().getMessage());
+    }
+    if (alert && !out.alerts.empty())
+        alert(out.alerts, alertContext);
+}
+
+void IpmiMI::stop()
+{
+    {
+        std::lock_guard<std::mutex> g(lock_);
+        stopping_ = true;
+    }
+    wake_.notify_all();
+    if (thread_.joinable())
+        thread_.join();
+}
+
+IC::Error IpmiMI::shutdown()
+{
+    stop();
+    return ok();
+}
+
+void IpmiMI::release()
+{
+    stop();
+    if (ownRootId_ != 0)
+        shipped::withdrawTop(ownRootId_);
+    // The library keeps pointers to our nodes, whose code leaves with us.
+    std::vector<std::string> paths;
+    for (auto const& n : nodes_) {
+        std::string path = n->knownPath();
+        if (!path.empty())
+            paths.push_back(std::move(path));
+    }
+    if (alertCB_ && !paths.empty())
+        alertCB_(std::vector<IC::Alert>{IC::Alert(shipped::kSeverityInfo, shipped::kNodeRemoval, paths,
+                                                  shipped::kStatusNormal, "ipmi unloaded")},
+                 alertContext_);
+    delete this;
+}
+
+} // namespace ipmi
+
+extern "C" __attribute__((visibility("default"))) unsigned char
+OpenMI(IC::ManagementInterface** mi, IC::Error** err)
+{
+    return shipped::openMI<ipmi::IpmiMI>(mi, err, "ipmi");
+}
