@@ -84,7 +84,7 @@ IC::Alert::ClassType parseClass(std::string const& text)
                 return static_cast<IC::Alert::ClassType>(c);
     throw UsageError("unknown alert class '" + text +
                      "' (node-arrival, node-removal, threshold, memory-errors, link, "
-                     "health-rollup, or a number)");
+                     "health-rollup, event-log, or a number)");
 }
 
 std::string severityName(unsigned int severity)
