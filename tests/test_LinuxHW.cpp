@@ -482,19 +482,12 @@ TEST_F(LinuxHwTest, UnloadingOnThisMachineMakesTheLibraryForgetEveryNode)
     ictest::EnvGuard real("IC_SYSFS_ROOT", "/");
     IC::Error* err = nullptr;
     ASSERT_EQ(Open(&ic_, &err), 0);
-    std::vector<std::string> paths;
-    for (Node* n : nodes())
-        paths.push_back(n->getPath());
-    ASSERT_GE(paths.size(), 4u); // ROOT, chassis, a CPU, the memory at least
+    ASSERT_GE(nodes().size(), 4u); // ROOT, chassis, a CPU, the memory at least
     std::this_thread::sleep_for(std::chrono::milliseconds(200)); // a few polls of the real tree
     close();
     std::vector<Node*> left;
     IC::InstCtrl::nodestore.getAllNodes(left);
     EXPECT_TRUE(left.empty());
-    for (std::string const& path : paths) {
-        Node* found = nullptr;
-        EXPECT_EQ(IC::InstCtrl::nodestore.getNode(path, &found).getStatus(), 1);
-    }
 }
 
 } // namespace
