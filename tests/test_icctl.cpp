@@ -280,6 +280,7 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
     } const cases[] = {
         {true, {"nodes", "--sensor", "Warp Core"}, 2, "icctl: unknown sensor type 'Warp Core' (give a "
          "name such as \"Temperature Sensor\" or a number; 'icctl sensors' lists them)\n"},
+        {true, {"nodes", "--sensor", "74"}, 2, "icctl: sensor type 74 is out of range (0..73)\n"},
         {true, {"show", "zz"}, 2, "(give the hexadecimal form that 'icctl nodes' shows)\n"},
         {true, {"show", "2f5c"}, 1, "icctl: no node at path 2f5c\n"},
         {true, {"watch", "--class", "bogus"}, 2, "icctl: unknown alert class 'bogus' ("},
@@ -291,6 +292,7 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
         {false, {"path", "ff"}, 2, "icctl: 'ff' is not a node path\n"},
         {false, {"path"}, 2, "icctl: give one of: a printable path, --encode CHAIN, --from-binary\n"},
         {false, {"path", "--encode", "ROOT:x"}, 2, "icctl: bad instance 'x' in 'ROOT:x'\n"},
+        {false, {}, 2, "subcommand is required"},
         {false, {"frobnicate"}, 2,
          "icctl: unknown command 'frobnicate' (tree, nodes, show, alerts, watch, path, sensors)\n"},
         {false, {"--mi-dir", nope, "--fp-dir", fp_.string(), "tree"}, 2,
