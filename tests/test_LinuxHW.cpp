@@ -238,6 +238,7 @@ TEST_F(LinuxHwTest, ThermalZonesStandInWhenThereIsNoHwmon)
 {
     useTree("small");
     fs::remove_all(root() + "/sys/class/hwmon");
+    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast"); // not a number: the default interval
     open();
     std::vector<std::string> temps;
     for (Node* n : nodes())
@@ -468,10 +469,6 @@ TEST_F(LinuxHwTest, MissingRootAndOddIntervalStillLoad)
         ictest::Watchdog guard(30, "unloading while the polling thread waits");
         close();
     }
-    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast");
-    useTree("small");
-    open();
-    EXPECT_EQ(nodes().size(), 17u);
 }
 
 // ------------------------------------------------------------------ lifecycle

@@ -250,9 +250,7 @@ TEST_F(Icctl, PathConvertsBetweenItsForms)
     EXPECT_EQ(doc.at("printable"), kTemp);
     EXPECT_EQ(doc.at("length"), 9);
     EXPECT_EQ(doc.at("binary"), "\\x1f\\x2b\\x01\\xf5\\x01\\xf2\\x01\\xf5\\xc0");
-    EXPECT_EQ(doc.at("bytes"), json({0x1f, 0x2b, 0x01, 0xf5, 0x01, 0xf2, 0x01, 0xf5, 0xc0}));
     EXPECT_EQ(doc.at("chain").at(0), json({{"type", 59}, {"typeName", "ROOT"}, {"instance", 0}}));
-    EXPECT_EQ(doc.at("chain").at(3).at("typeName"), "Temperature Sensor");
     EXPECT_EQ(doc.at("hierarchy"), kHierarchy);
     EXPECT_EQ(lines(out(bare({"path", kFan}))).at(3), "chain        ROOT 0 -> Chassis 0 -> Fan 1");
     // Chains are written root first, also as the library's hierarchy text.
