@@ -2,18 +2,13 @@
 // holding the fake management interface (fakehw) and the health plug-in.
 // JSON output is parsed back; the exit status is checked for every kind of
 // bad input.
-#include <gtest/gtest.h>
+#include "TestSupport.h"
+
 #include <nlohmann/json.hpp>
 
 #include <sys/wait.h>
 
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <map>
-#include <sstream>
-#include <string>
-#include <vector>
 
 namespace fs = std::filesystem;
 using nlohmann::json;
@@ -81,9 +76,6 @@ class Icctl : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        char templ[] = "/tmp/ic-icctl-XXXXXX";
-        ASSERT_NE(mkdtemp(templ), nullptr);
-        dir_ = templ;
         fs::create_directories(mi_ = dir_ / "mi");
         fs::create_directories(fp_ = dir_ / "fp");
         fs::create_symlink(HEALTH_PLUGIN, fp_ / "health.so");
@@ -92,12 +84,6 @@ protected:
                               "FAKEHW_PULSE_HOLD"})
             unsetenv(v);
     }
-    void TearDown() override
-    {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     void useFakeHw() { fs::create_symlink(FAKEHW_PLUGIN, mi_ / "fakehw.so"); }
 
     // icctl without the directory options, after prefix (such as "timeout
@@ -117,7 +103,8 @@ protected:
         return bare(args, "", prefix);
     }
 
-    fs::path dir_, mi_, fp_;
+    ictest::TempDir tmp_{"ic-icctl"};
+    fs::path dir_ = tmp_.root(), mi_, fp_;
 };
 
 TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
