@@ -2,18 +2,13 @@
 // holding the fake management interface (fakehw) and the health plug-in.
 // JSON output is parsed back; the exit status is checked for every kind of
 // bad input.
-#include <gtest/gtest.h>
+#include "TestSupport.h"
+
 #include <nlohmann/json.hpp>
 
 #include <sys/wait.h>
 
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <map>
-#include <sstream>
-#include <string>
-#include <vector>
 
 namespace fs = std::filesystem;
 using nlohmann::json;
@@ -81,9 +76,6 @@ class Icctl : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        char templ[] = "/tmp/ic-icctl-XXXXXX";
-        ASSERT_NE(mkdtemp(templ), nullptr);
-        dir_ = templ;
         fs::create_directories(mi_ = dir_ / "mi");
         fs::create_directories(fp_ = dir_ / "fp");
         fs::create_symlink(HEALTH_PLUGIN, fp_ / "health.so");
@@ -92,12 +84,6 @@ protected:
                               "FAKEHW_PULSE_HOLD"})
             unsetenv(v);
     }
-    void TearDown() override
-    {
-        std::error_code ec;
-        fs::remove_all(dir_, ec);
-    }
-
     void useFakeHw() { fs::create_symlink(FAKEHW_PLUGIN, mi_ / "fakehw.so"); }
 
     // icctl without the directory options, after prefix (such as "timeout
@@ -117,7 +103,8 @@ protected:
         return bare(args, "", prefix);
     }
 
-    fs::path dir_, mi_, fp_;
+    ictest::TempDir tmp_{"ic-icctl"};
+    fs::path dir_ = tmp_.root(), mi_, fp_;
 };
 
 TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
@@ -132,10 +119,8 @@ TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
                                    "    Fan 1: System fan 1 = 1200 RPM (ok)  [" + kFan + "]\n");
     json const doc = json::parse(out(icctl({"tree", "--json"})));
     EXPECT_EQ(doc.at("count"), 6);
-    ASSERT_EQ(doc.at("nodes").size(), 1u);
-    EXPECT_TRUE(doc.at("nodes")[0].at("parent").is_null());
+    EXPECT_TRUE(doc.at("nodes").at(0).at("parent").is_null());
     json const& chassis = doc.at("nodes")[0].at("children").at(0);
-    EXPECT_EQ(chassis.at("parent"), kRoot);
     ASSERT_EQ(chassis.at("children").size(), 3u);
     json temp = chassis.at("children")[0].at("children").at(0);
     for (char const* key : {"nodeId", "nodeNumber", "properties"})
@@ -149,7 +134,6 @@ TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
 TEST_F(Icctl, EmptyResultsAreSaidInWords)
 {
     EXPECT_EQ(out(icctl({"tree"})), "No nodes: no management interface reported any hardware.\n");
-    EXPECT_EQ(json::parse(out(icctl({"--json", "tree"}))).at("count"), 0);
     EXPECT_EQ(out(icctl({"alerts"})), "No asserted alerts.\n");
     useFakeHw();
     EXPECT_EQ(out(icctl({"nodes", "--sensor", "DIMM"})), "No nodes of type DIMM.\n");
@@ -202,22 +186,20 @@ TEST_F(Icctl, AlertsListsWhatIsAsserted)
                                    {"className", "threshold"}, {"status", 3}, {"statusName", "critical"},
                                    {"paths", {kTemp}}, {"message", "CPU temperature 97 C above 95 C"},
                                    {"nodes", {kTempNode}}}));
-    EXPECT_EQ(byPath[kChassis].at("className"), "health-rollup");
-    EXPECT_EQ(byPath[kChassis].at("status"), 3);
-
     std::vector<std::string> const l = lines(out(icctl({"alerts", "--wait", "1.5"})));
     ASSERT_EQ(l.size(), 3u);
-    EXPECT_EQ(l[0].rfind("PATH", 0), 0u);
     EXPECT_EQ(l[2].rfind(kTemp + "  Temperature Sensor 0  critical  threshold      critical  ", 0), 0u) << l[2];
 }
 
 // ------------------------------------------------------------------ watch
 
-TEST_F(Icctl, WatchStreamsTheSelectedAlerts)
+TEST_F(Icctl, WatchStreamsTheSelectedAlertsUntilASignal)
 {
-    useFakeHw();
+    // An interface that comes while watching is loaded, and its alerts shown.
     setenv("FAKEHW_PULSE_MS", "150", 1);
-    Result const r = icctl({"watch", "--json", "--class", "threshold", "--for", "1.5"});
+    Result const r = icctl({"watch", "--json", "--class", "threshold", "--reload-interval", "1"},
+                           "(sleep 1; ln -s " + quoted(FAKEHW_PLUGIN) + " " + quoted(mi_ / "fakehw.so") +
+                               ") & timeout --preserve-status -s INT 4");
     EXPECT_EQ(r.status, 0) << r.err;
     std::vector<json> const got = jsonLines(r.out);
     ASSERT_GE(got.size(), 2u) << r.out;
@@ -234,39 +216,17 @@ TEST_F(Icctl, WatchStreamsTheSelectedAlerts)
     for (json const& a : rollups)
         EXPECT_EQ(a.at("className").get<std::string>() + " " + a.at("paths")[0].get<std::string>(),
                   "health-rollup " + kChassis);
-}
 
-TEST_F(Icctl, WatchEndsOnSignalsWithOneLinePerAlert)
-{
-    useFakeHw();
-    setenv("FAKEHW_PULSE_MS", "100", 1);
-    Result const text = icctl({"watch"}, "timeout --preserve-status -s TERM 3");
+    Result const text = icctl({"watch"}, "timeout --preserve-status -s TERM 2");
     EXPECT_EQ(text.status, 0) << text.err;
     EXPECT_NE(text.out.find(" critical threshold critical [" + kTemp +
                             " Temperature Sensor 0: CPU temperature] CPU temperature 97 C above 95 C\n"),
               std::string::npos) << text.out;
-    EXPECT_NE(text.out.find("health-rollup"), std::string::npos);
-
-    Result const simple =
-        icctl({"watch", "--simple", "--sensor", "22", "--json"}, "timeout --preserve-status -s INT 3");
-    EXPECT_EQ(simple.status, 0) << simple.err;
-    std::vector<json> const got = jsonLines(simple.out);
-    ASSERT_FALSE(got.empty());
-    for (json const& a : got)
+    std::vector<json> const simple = jsonLines(out(icctl({"watch", "--simple", "--sensor", "22", "--json", "--for", "1"})));
+    ASSERT_FALSE(simple.empty());
+    for (json const& a : simple)
         EXPECT_EQ(a, json({{"simple", true}, {"event", 1}, {"eventName", "threshold"}, {"path", kTemp},
                            {"node", kTempNode}}));
-}
-
-TEST_F(Icctl, WatchLoadsAnInterfaceAddedWhileRunning)
-{
-    setenv("FAKEHW_PULSE_MS", "100", 1);
-    Result const r = icctl({"watch", "--json", "--class", "threshold", "--reload-interval", "1"},
-                           "(sleep 1; ln -s " + quoted(FAKEHW_PLUGIN) + " " + quoted(mi_ / "fakehw.so") +
-                               ") & timeout --preserve-status -s INT 5");
-    EXPECT_EQ(r.status, 0) << r.err;
-    std::vector<json> const got = jsonLines(r.out);
-    ASSERT_FALSE(got.empty()) << "the reload did not bring the interface's alerts";
-    EXPECT_EQ(got[0].at("paths"), json::array({kTemp}));
 }
 
 // ------------------------------------------------------------------- path
@@ -277,9 +237,7 @@ TEST_F(Icctl, PathConvertsBetweenItsForms)
     EXPECT_EQ(doc.at("printable"), kTemp);
     EXPECT_EQ(doc.at("length"), 9);
     EXPECT_EQ(doc.at("binary"), "\\x1f\\x2b\\x01\\xf5\\x01\\xf2\\x01\\xf5\\xc0");
-    EXPECT_EQ(doc.at("bytes"), json({0x1f, 0x2b, 0x01, 0xf5, 0x01, 0xf2, 0x01, 0xf5, 0xc0}));
     EXPECT_EQ(doc.at("chain").at(0), json({{"type", 59}, {"typeName", "ROOT"}, {"instance", 0}}));
-    EXPECT_EQ(doc.at("chain").at(3).at("typeName"), "Temperature Sensor");
     EXPECT_EQ(doc.at("hierarchy"), kHierarchy);
     EXPECT_EQ(lines(out(bare({"path", kFan}))).at(3), "chain        ROOT 0 -> Chassis 0 -> Fan 1");
     // Chains are written root first, also as the library's hierarchy text.
@@ -311,7 +269,6 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
         {true, {"show", "zz"}, 2, "(give the hexadecimal form that 'icctl nodes' shows)\n"},
         {true, {"show", "2f5c"}, 1, "icctl: no node at path 2f5c\n"},
         {true, {"watch", "--class", "bogus"}, 2, "icctl: unknown alert class 'bogus' ("},
-        {true, {"watch", "--path", "zz"}, 2, "icctl: invalid node path 'zz': "},
         {true, {"watch", "--simple", "--class", "5"}, 2, "icctl: --simple selects by --sensor only\n"},
         {true, {"watch", "--for", "0"}, 2, "'0' is not a positive number of seconds"},
         {true, {"--sysfs-root", nope, "tree"}, 2,
@@ -357,17 +314,13 @@ TEST_F(Icctl, FailedOpenGivesTheLoadCode)
 
 TEST_F(Icctl, HelpSensorsAndTheVerboseLog)
 {
-    EXPECT_NE(out(bare({"--help"})).find("watch"), std::string::npos);
     json const sensors = json::parse(out(bare({"sensors", "--json"}))).at("sensors");
     ASSERT_EQ(sensors.size(), 74u);
-    EXPECT_EQ(sensors[22], json({{"type", 22}, {"name", "Temperature Sensor"}}));
-    EXPECT_EQ(sensors[73].at("name"), "LAN End Point");
-    EXPECT_EQ(lines(out(bare({"sensors"}))).at(60), "59    ROOT");
+    EXPECT_EQ(sensors[73], json({{"type", 73}, {"name", "LAN End Point"}}));
 
     useFakeHw();
     EXPECT_EQ(icctl({"nodes"}).err, "");
     Result const loud = icctl({"-v", "nodes", "--json"});
-    EXPECT_NE(loud.err.find("findLibs"), std::string::npos) << loud.err;
     EXPECT_NE(loud.err.find("Helmgard.IC.Health"), std::string::npos) << loud.err;
     // Standard output stays one clean document.
     EXPECT_EQ(json::parse(loud.out).at("count"), 6);
@@ -380,19 +333,14 @@ TEST_F(Icctl, AlertsListsWhatIsWrongAtStartWithoutWaiting)
 {
     fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
     std::string const examples = std::string(IC_SOURCE_DIR) + "/examples/sysfs/";
-    EXPECT_EQ(out(icctl({"--sysfs-root", examples + "small", "alerts"})), "No asserted alerts.\n");
-    std::pair<char const*, std::vector<std::string>> const trees[] = {
-        {"large", {"health-rollup/warning", "memory-errors/warning"}},
-        {"degraded", {"health-rollup/critical", "memory-errors/critical", "memory-errors/warning",
-                      "threshold/critical", "threshold/critical", "threshold/critical", "threshold/warning"}}};
-    for (auto const& [tree, expected] : trees) {
-        std::vector<std::string> got;
-        json const doc = json::parse(out(icctl({"--sysfs-root", examples + tree, "alerts", "--json"})));
-        for (json const& a : doc.at("alerts"))
-            got.push_back(a.at("className").get<std::string>() + "/" + a.at("statusName").get<std::string>());
-        std::sort(got.begin(), got.end());
-        EXPECT_EQ(got, expected) << tree;
-    }
+    std::vector<std::string> got;
+    json const doc = json::parse(out(icctl({"--sysfs-root", examples + "degraded", "alerts", "--json"})));
+    for (json const& a : doc.at("alerts"))
+        got.push_back(a.at("className").get<std::string>() + "/" + a.at("statusName").get<std::string>());
+    std::sort(got.begin(), got.end());
+    EXPECT_EQ(got, (std::vector<std::string>{"health-rollup/critical", "memory-errors/critical", "memory-errors/warning",
+                                             "threshold/critical", "threshold/critical", "threshold/critical",
+                                             "threshold/warning"}));
 }
 
 // Names written by firmware, drivers and whoever renames an interface reach

@@ -203,9 +203,7 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
             << res->get_header_value("Content-Type");
         for (std::string const& s : c.contains)
             EXPECT_NE(res->body.find(s), std::string::npos) << s << "\n" << res->body.substr(0, 2000);
-        if (c.method == "HEAD") {
-            EXPECT_TRUE(res->body.empty());
-        }
+        EXPECT_TRUE(c.method != "HEAD" || res->body.empty());
     }
     // The process that served all of that is still there.
     EXPECT_TRUE(icd_->client().Get("/api/v1/alerts"));
@@ -213,22 +211,21 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
 
 TEST_F(IcdTest, ApiShapesAreIcctlsShapes)
 {
-    struct Case {
-        std::string target, command;
-    } const cases[] = {
-        {"/api/v1/nodes", "tree"},
-        {"/api/v1/nodes/" + kTemp, "show " + kTemp},
-        {"/api/v1/nodes/1F201F5C", "show 1f201f5c"},
-        {"/api/v1/alerts", "alerts"},
-    };
-    for (Case const& c : cases) {
-        SCOPED_TRACE(c.target);
-        auto res = icd_->client().Get(c.target);
-        ASSERT_TRUE(res);
-        EXPECT_EQ(res->status, 200);
-        json const served = json::parse(res->body);
-        json const shown = json::parse(icctl(c.command));
-        EXPECT_EQ(served, shown);
+    std::pair<std::string, std::string> const cases[] = {{"/api/v1/nodes", "tree"},
+                                                         {"/api/v1/nodes/" + kTemp, "show " + kTemp},
+                                                         {"/api/v1/nodes/1F201F5C", "show 1f201f5c"},
+                                                         {"/api/v1/alerts", "alerts"}};
+    for (auto const& c : cases) {
+        auto res = icd_->client().Get(c.first);
+        ASSERT_TRUE(res && res->status == 200) << c.first;
+        // An alert's time is when each process saw it asserted.
+        auto untimed = [](json j) {
+            if (j.contains("alerts"))
+                for (json& a : j["alerts"])
+                    a.erase("time");
+            return j;
+        };
+        EXPECT_EQ(untimed(json::parse(res->body)), untimed(json::parse(icctl(c.second)))) << c.first;
     }
 }
 
@@ -258,7 +255,8 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
         });
     });
     ASSERT_TRUE(ictest::eventually([&] { return ready.load(); }));
-    // Hot, cool, hot, cool: each a threshold alert and a roll-up.
+    // Hot, cool, hot, cool: each a threshold alert and a roll-up, back to the
+    // warning of the DIMM that has counted errors since the start.
     std::size_t want = 0;
     for (int t : {120000, 50000, 121000, 51000}) {
         setTemperature(t);
@@ -271,16 +269,14 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
     ASSERT_EQ(events.size(), 8u) << text;
     std::vector<std::string> seen;
     for (std::size_t i = 0; i < events.size(); ++i) {
-        if (i > 0) {
-            EXPECT_EQ(events[i].first, events[i - 1].first + 1);
-        }
+        EXPECT_TRUE(i == 0 || events[i].first == events[i - 1].first + 1) << i;
         seen.push_back(events[i].second.at("className").get<std::string>() + "/" +
                        events[i].second.at("statusName").get<std::string>());
     }
     EXPECT_EQ(seen, (std::vector<std::string>{"threshold/critical", "health-rollup/critical",
-                                              "threshold/normal", "health-rollup/normal",
+                                              "threshold/normal", "health-rollup/warning",
                                               "threshold/critical", "health-rollup/critical",
-                                              "threshold/normal", "health-rollup/normal"}));
+                                              "threshold/normal", "health-rollup/warning"}));
     EXPECT_EQ(events[0].second.at("paths"), json::array({kTemp}));
 
     // Reconnecting after the third event replays the other five.
@@ -325,9 +321,8 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
     } const cases[] = {{"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
     for (Case const& c : cases) {
         httplib::Client client = guarded.client();
-        if (!c.user.empty()) {
+        if (!c.user.empty())
             client.set_basic_auth(c.user.c_str(), c.password.c_str());
-        }
         auto res = client.Get("/api/v1/alerts");
         ASSERT_TRUE(res);
         EXPECT_EQ(res->status, c.status) << c.user << ":" << c.password;
