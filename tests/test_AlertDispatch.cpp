@@ -268,14 +268,6 @@ TEST_F(Registration, OneRegisterPerPairIndexedOncePerKeyGoneWithItsLastFilterAnd
     EXPECT_EQ(ICC::callbacks.count({recA, &c4}), 1u);
     expectError(ICC::deRegisterForAlerts(recA, Paths{}, &c4), 0);
     EXPECT_EQ(ICC::callbacks.count({recA, &c4}), 0u);
-    // The workers take the kind given and ignore it on removal.
-    SD::MutexGuard g(ICC::registerlock); // which the sensor forms expect held
-    expectError(ICC::regAlerts(recB, ST::CPU, &c2, IC::FP_REGISTRATION), 0);
-    expectError(ICC::regAlerts(recB, Paths{P0}, &c2, IC::FP_REGISTRATION), 0);
-    EXPECT_EQ(kind(recB, &c2), 0u);
-    expectError(ICC::deRegAlerts(recB, ST::CPU, &c2, IC::CLIENT_REGISTRATION), 0);
-    expectError(ICC::deRegAlerts(recB, Paths{P0}, &c2, IC::CLIENT_REGISTRATION), 0);
-    EXPECT_EQ(ICC::callbacks.count({recB, &c2}), 0u);
 }
 
 TEST_F(SimpleAlerts, OneCallPerPathWithTheClassesCodeUnderTheLockAndTheSmallestFreeSlotReused)
