@@ -330,6 +330,7 @@ void LinuxHwMI::reconcile(DeviceList& found, bool changing, bool announce, Outbo
         bool const isNew = it == tracked_.end();
         if (isNew && nextNumber_ > kMaxNumber) {
             ++leftOut;
+            d = Device(); // its text is of no further use
             continue;
         }
         Tracked& t = tracked_[d.key];
@@ -506,8 +507,11 @@ void LinuxHwMI::removeMissing(std::set<std::string> const& seen, Outbox& out)
             gone.insert(key);
             t.present = false;
         }
-        children.emplace(t.device.parentKey, key);
     }
+    if (gone.empty())
+        return;
+    for (std::string const& key : order_)
+        children.emplace(tracked_.at(key).device.parentKey, key);
     for (std::string const& key : order_) {
         if (gone.count(key) == 0 || gone.count(tracked_.at(key).device.parentKey) != 0)
             continue;

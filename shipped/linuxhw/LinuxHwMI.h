@@ -105,7 +105,8 @@ private:
     };
 
     DeviceList scanChanging();
-    // Moves the devices it takes on out of found.
+    // Moves the devices it takes on out of found and empties those it
+    // leaves out.
     void reconcile(DeviceList& found, bool changing, bool announce, Outbox& out);
     void update(Tracked& t, Device const& d, Outbox& out);
     // The condition a device has when it is first seen: what is wrong then
