@@ -54,6 +54,10 @@ struct Device {
                 p.unit = unit;
                 return;
             }
+        // A device holds a handful: no room to spare, as a very large
+        // machine has a hundred thousand of them.
+        if (properties.size() == properties.capacity())
+            properties.reserve(properties.size() + 1);
         properties.push_back(IC::Node::Property{name, value, unit});
     }
 };

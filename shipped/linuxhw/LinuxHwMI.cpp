@@ -136,7 +136,7 @@ IC::Error LinuxHwMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         SD::MutexGuard g(lock_);
         packages_ = packages;
     }
-    DeviceList const changing = scanChanging();
+    DeviceList changing = scanChanging();
     Outbox unused;
     SD::MutexGuard g(lock_);
     reconcile(fixed, false, false, unused);
@@ -226,7 +226,7 @@ DeviceList LinuxHwMI::scanChanging()
 
 void LinuxHwMI::poll()
 {
-    DeviceList const found = scanChanging();
+    DeviceList found = scanChanging();
     Outbox out;
     // The adopted ROOT is gone once the plug-in that reported it withdrew it
     // (it was released); its node is never touched from here.
@@ -250,7 +250,7 @@ void LinuxHwMI::poll()
     deliver(out);
 }
 
-void LinuxHwMI::rehome(DeviceList const& fixed, Outbox& out)
+void LinuxHwMI::rehome(DeviceList& fixed, Outbox& out)
 {
     // Our nodes hang below a chassis the library no longer has: take them
     // back and announce them again below a ROOT and Chassis of our own.
@@ -301,11 +301,13 @@ unsigned int LinuxHwMI::claimInstance(Tracked& t, Device const& d)
     return instance;
 }
 
-void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce, Outbox& out)
+void LinuxHwMI::reconcile(DeviceList& found, bool changing, bool announce, Outbox& out)
 {
     std::set<std::string> seen;
     std::size_t leftOut = 0;
-    for (Device const& d : found) {
+    // A new device is moved into its record, not copied: a scan of a very
+    // large machine is most of the plug-in's memory.
+    for (Device& d : found) {
         if (!seen.insert(d.key).second || adopted_.count(d.key) != 0)
             continue; // two entries of one identity: the first one counts
         auto it = tracked_.find(d.key);
@@ -328,6 +330,7 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
         bool const isNew = it == tracked_.end();
         if (isNew && nextNumber_ > kMaxNumber) {
             ++leftOut;
+            d = Device(); // its text is of no further use
             continue;
         }
         Tracked& t = tracked_[d.key];
@@ -343,16 +346,16 @@ void LinuxHwMI::reconcile(DeviceList const& found, bool changing, bool announce,
         t.node = nodes_.back().get();
         for (IC::Node::Property const& p : d.properties)
             t.node->setProperty(p.name, p.value, p.unit);
-        t.device = d;
+        t.device = std::move(d);
         t.present = true;
         t.changing = changing;
-        judgeAtStart(t, d);
+        judgeAtStart(t, t.device);
         show(t);
         if (announce) {
             out.arrivals.push_back(t.node);
             if (t.raised != shipped::kStatusNormal)
                 out.troubled.push_back(t.node);
-            LHW_LOG(kProgress, "arrived: ", d.description);
+            LHW_LOG(kProgress, "arrived: ", t.device.description);
         }
     }
     // Node ids carry 16 bits of our own: said once a scan, not once a device.
@@ -504,8 +507,11 @@ void LinuxHwMI::removeMissing(std::set<std::string> const& seen, Outbox& out)
             gone.insert(key);
             t.present = false;
         }
-        children.emplace(t.device.parentKey, key);
     }
+    if (gone.empty())
+        return;
+    for (std::string const& key : order_)
+        children.emplace(tracked_.at(key).device.parentKey, key);
     for (std::string const& key : order_) {
         if (gone.count(key) == 0 || gone.count(tracked_.at(key).device.parentKey) != 0)
             continue;

@@ -105,7 +105,9 @@ private:
     };
 
     DeviceList scanChanging();
-    void reconcile(DeviceList const& found, bool changing, bool announce, Outbox& out);
+    // Moves the devices it takes on out of found and empties those it
+    // leaves out.
+    void reconcile(DeviceList& found, bool changing, bool announce, Outbox& out);
     void update(Tracked& t, Device const& d, Outbox& out);
     // The condition a device has when it is first seen: what is wrong then
     // is asserted from the start, without an alert of its own.
@@ -117,7 +119,7 @@ private:
     static void show(Tracked const& t);
     void removeMissing(std::set<std::string> const& seen, Outbox& out);
     // The adopted ROOT/Chassis went away (its plug-in was unloaded).
-    void rehome(DeviceList const& fixed, Outbox& out);
+    void rehome(DeviceList& fixed, Outbox& out);
     // Records the ROOT and Chassis we report for the plug-ins loaded later.
     void announceOwnTop();
     unsigned int claimInstance(Tracked& t, Device const& d);

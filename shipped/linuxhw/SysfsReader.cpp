@@ -41,7 +41,7 @@ std::string SysfsReader::full(std::string const& rel) const
 }
 
 SysfsReader::Result SysfsReader::read(std::string const& rel, std::string& out, std::size_t limit,
-                                      std::string& why) const
+                                      std::string& why, bool firstLine) const
 {
     out.clear();
     // Non-blocking, so that a FIFO cannot hang the poll.
@@ -72,6 +72,10 @@ SysfsReader::Result SysfsReader::read(std::string const& rel, std::string& out, 
         if (n == 0)
             break;
         out.append(buf, static_cast<std::size_t>(n));
+        // A line's reader needs nothing past its end: no read for the end
+        // of the file (a sysfs attribute comes whole in one read).
+        if (firstLine && std::memchr(buf, '\n', static_cast<std::size_t>(n)))
+            break;
     }
     ::close(fd);
     return Result::Ok;
@@ -81,7 +85,7 @@ std::optional<std::string> SysfsReader::line(std::string const& rel, bool quiet,
 {
     std::string raw;
     std::string why;
-    switch (read(rel, raw, kLineLimit, why)) {
+    switch (read(rel, raw, kLineLimit, why, true)) {
     case Result::Missing:
         return std::nullopt;
     case Result::Unreadable:
@@ -141,7 +145,7 @@ std::optional<std::string> SysfsReader::contents(std::string const& rel, std::si
 {
     std::string out;
     std::string why;
-    switch (read(rel, out, limit, why)) {
+    switch (read(rel, out, limit, why, false)) {
     case Result::Missing:
         return std::nullopt;
     case Result::Unreadable:

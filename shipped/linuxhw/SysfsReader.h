@@ -52,7 +52,9 @@ public:
 
 private:
     enum class Result { Ok, Missing, Unreadable };
-    Result read(std::string const& rel, std::string& out, std::size_t limit, std::string& why) const;
+    // With firstLine it stops once a newline has been read.
+    Result read(std::string const& rel, std::string& out, std::size_t limit, std::string& why,
+                bool firstLine) const;
     std::optional<std::string> line(std::string const& rel, bool quiet, bool settle);
     void settled(std::string const& rel);
 
