@@ -48,7 +48,6 @@ TEST(FindLibs, OpensEveryLibraryOfTheDirectoryInNameOrder)
     std::vector<IC::libstruct> libs(1);
     libs[0].name = "earlier.so";
     std::set<std::string> names{"kept"};
-    ictest::LogCapture cap;
     ictest::expectError(IC::LoadControl().findLibs(dir, libs, names), 0);
     ictest::expectError(IC::LoadControl().findLibs(dir + "/", libs, names), 0);
     EXPECT_EQ(names, std::set<std::string>{"kept"});
@@ -58,9 +57,6 @@ TEST(FindLibs, OpensEveryLibraryOfTheDirectoryInNameOrder)
         EXPECT_EQ(libs[i].path, dir + (i > 3 ? "//" : "/") + name);
         EXPECT_TRUE(libs[i].name == name && libs[i].handle && !libs[i].plugin && libs[i].idbase == 0u);
     }
-    ictest::expectEvent(cap, {ictest::kLogLC, "LoadControl"}, "findLibs: Looking for directory " + dir, 3000,
-                        "findLibs");
-    EXPECT_EQ(cap.logs(ictest::kLogLC).size(), 12u) << "one line per directory and per file";
     EXPECT_TRUE(ictest::isMapped(dir));
     for (auto& r : libs)
         SD::PlatformUtilities::unloadLibrary(r.handle);
@@ -200,7 +196,6 @@ TEST_F(Loaders, LoadsEachWithTheNextNumberAndCountsTheFailures)
     EXPECT_EQ(recs(toLoad_), (Strings{"a1.so 7", "a3.so 8"}));
     EXPECT_EQ(recs(fplibs_), recs(toLoad_));
     EXPECT_TRUE(fplibs_[1].handle == toLoad_[1].handle && fplibs_[1].path == path && fplibs_[1].plugin == two.object);
-    ictest::expectEvent(cap, {kLogFP, "FPControl"}, "myloadFPs: " + path + " Initialize Done", 3000, "myloadFPs");
     ictest::fs::remove(tree_.fpDir() + "/a2.so");
     tree_.addFP("fp_code");
     expectError(loadFPs(), 0, IC::Number(1u), "Count of FPs that did not load");
@@ -387,10 +382,8 @@ TEST_F(Loaders, AReloadFollowsTheDirectory)
     ictest::LogCapture cap;
     expectError(reloadFPs(), 0);
     EXPECT_EQ(recs(fplibs_), (Strings{"fp_one.so 7", "fp_two.so 8"}));
-    EXPECT_EQ(cap.count(kLogFP, 3000, " reloadFPs: Done adding FPs"), 1u);
-    cap.clear();
     expectError(reloadFPs(), 0);
-    EXPECT_EQ(cap.messages(kLogFP), (Strings{" reLoadFPs:", " reloadFPs: Done - no additions"}));
+    EXPECT_EQ(cap.count(kLogFP, 3000, " reloadFPs: Done - no additions"), 1u);
     ictest::fs::remove(two);
     expectError(reloadFPs(), 0);
     EXPECT_TRUE(count(ictest::calls(cap), "fp_two:release") == 1u && !ictest::isMapped(two));
