@@ -1,5 +1,5 @@
 // Tests of IC::NodeStore: path codes, the registry, path calculation,
-// hierarchy text and concurrent use.
+// hierarchy text.
 #include <IC/NodeStore.h>
 #include <IC/SensorTypeNames.h>
 
@@ -7,7 +7,6 @@
 
 #include <algorithm>
 #include <cstdint>
-#include <memory>
 #include <random>
 
 namespace {
@@ -284,65 +283,6 @@ TEST_F(NodeStoreTest, HierarchyRunsFromTheStopTypeOrTheRootDownWithProgressEvent
     // Names from both ends and the middle: a name lost or added shifts every one after it.
     EXPECT_EQ((Strings{IC::sensorTypeName(0), IC::sensorTypeName(36), IC::sensorTypeName(73), IC::sensorTypeName(75)}),
               (Strings{"Unknown", "Tallowmere", "LAN End Point", "invalid"}));
-}
-
-TEST(NodeStoreConcurrency, ParallelAddsAndQueriesLeaveEveryIndexConsistent)
-{
-    constexpr unsigned int kWriters = 4, kPer = 100, kContested = 16, kAll = kPer + kContested;
-    NodeStore store;
-    Node sharedRoot(ST::ROOT, 0, 1, 0, "shared root");
-    ASSERT_TRUE(addNew(store, sharedRoot));
-    // Writer w adds, parents first, a tree of CPUs under a root of instance
-    // 100 + w (odd writers as management nodes), then its copy of every
-    // contested fan: the same path for all writers, distinct ids.
-    std::vector<Node> nodes;
-    nodes.reserve(kWriters * kAll);
-    for (unsigned int w = 0, base = 1 << 16; w < kWriters; ++w, base += 1 << 16) {
-        nodes.emplace_back(ST::ROOT, 100 + w, base | 1, 0, "root");
-        for (unsigned int i = 1; i < kPer; ++i)
-            nodes.emplace_back(ST::CPU, i, base | (i + 1), base | ((i - 1) / 3 + 1), "cpu");
-        for (unsigned int j = 0; j < kContested; ++j)
-            nodes.emplace_back(ST::Fan, j, base | 0x8000u | j, 1u, "fan");
-    }
-    std::vector<char> won(nodes.size());
-    std::atomic<int> failures{0};
-    {
-        std::vector<ictest::JoinedThread> threads;
-        for (unsigned int w = 0; w < kWriters; ++w)
-            threads.emplace_back([&, w] {
-                for (unsigned int k = 0; k < kAll; ++k) {
-                    std::size_t const at = w * kAll + (k < kPer ? k : kPer + (k + w * 5) % kContested);
-                    bool isNew = false;
-                    failures += w % 2 && k < kPer ? store.addMINode(Nodes{&nodes[at]}).getStatus() != 0
-                                                  : store.addNodeIfNew(&nodes[at], isNew).getStatus() != 0;
-                    won[at] = isNew;
-                }
-            });
-        threads.emplace_back([&] {
-            Nodes v;
-            for (unsigned int round = 0; round < 300; ++round) {
-                Node *n = &nodes[round * 7 % nodes.size()], *hit = nullptr;
-                failures += store.getNode(n->getNodeId(), &hit).getStatus() == 0 && hit != n;
-                failures += store.getMap(v).getStatus() != 0 || store.getMap(v, ST::Fan).getStatus() != 0;
-                failures += !v.empty() && store.getNodeHierarchy(v.back()).compare(0, 5, "ROOT:") != 0;
-            }
-        });
-    }
-    EXPECT_EQ(failures.load(), 0);
-    for (unsigned int w = 0; w < kWriters; ++w)
-        for (unsigned int i = 1; i < kPer; ++i) {
-            Node *n = &nodes[w * kAll + i], *parent = &nodes[w * kAll + (i - 1) / 3];
-            TopoVec want{{ST::CPU, i}};
-            store.uniqueid2topovec(parent->getPath(), 74, want);
-            ASSERT_EQ(paths(*n), refHex(want) + "|" + hex(parent->getPath()));
-            ASSERT_EQ(found(store, n->getNodeId(), n->getPath()), (Nodes{n, n}));
-        }
-    for (unsigned int j = 0, owners = 0; j < kContested; ++j, owners = 0) {
-        for (std::size_t at = kPer + j; at < nodes.size(); at += kAll)
-            owners += won[at] != 0 && lookup(store, nodes[at].getPath()) == &nodes[at];
-        EXPECT_EQ(owners, 1u) << "contested " << j;
-    }
-    EXPECT_EQ(listed(store).size(), 1 + kContested + kWriters / 2 * kPer);
 }
 
 } // namespace
