@@ -140,22 +140,6 @@ TEST_F(Lifecycle, AFailedFirstOpenUndoesItself)
     EXPECT_NE(error_, shared);
 }
 
-// Every open keeps its base path with a separator, never emptied; the log
-// directory makes no difference.
-TEST_F(Lifecycle, EveryOpenKeepsItsBasePath)
-{
-    tree_.addMI("mi_alpha");
-    std::string const base = tree_.path("base");
-    std::size_t const before = IST::icbaselibpath.size();
-    ASSERT_EQ(Openliblog(&control_, &error_, base + "-a", tree_.path("no-logs-here")) +
-                  Openlib(&control_, &error_, base + "-b/") + Openlib(&control_, &error_, "") +
-                  Openliblog(&control_, &error_, base + "-a", tree_.root() + "/"),
-              0);
-    EXPECT_TRUE(IST::ICloadCount == 4u && error_->getStatus() == 0 && IST::mymis.size() == 1u);
-    EXPECT_EQ(IST::icbaselibpath.size(), before + 2);
-    EXPECT_EQ(IST::icbaselibpath.count(base + "-a/") + IST::icbaselibpath.count(base + "-b/"), 2u);
-}
-
 // A process that never opened the library: a timed reload does nothing, the
 // first unload tears down (nothing), and the open after it is a first open.
 // Runs in a child process, so that the library's state is really untouched.
