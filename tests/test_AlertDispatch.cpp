@@ -14,8 +14,7 @@ namespace {
 
 namespace ICC = IC::InstCtrl;
 using IC::Alert;
-using ictest::expectError;
-using ictest::hex;
+using namespace ictest;
 using Strings = std::vector<std::string>;
 using Paths = Strings;
 using Keys = std::multiset<std::string>;

@@ -7,8 +7,7 @@
 
 namespace {
 
-using ictest::kLogIC;
-using ictest::seen;
+using namespace ictest;
 namespace IST = IC::InstCtrl;
 using Strings = std::vector<std::string>;
 using Nodes = std::vector<IC::Node*>;

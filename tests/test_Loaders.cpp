@@ -15,11 +15,7 @@
 
 namespace {
 
-using ictest::expectError;
-using ictest::kLogFP;
-using ictest::kLogMI;
-using ictest::recs;
-using ictest::seen;
+using namespace ictest;
 using Strings = std::vector<std::string>;
 using MIs = std::vector<IC::ManagementInterface*>;
 

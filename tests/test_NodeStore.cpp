@@ -13,9 +13,7 @@ namespace {
 
 using IC::Node;
 using IC::NodeStore;
-using ictest::addNew;
-using ictest::expectError;
-using ictest::hex;
+using namespace ictest;
 using TopoVec = NodeStore::TopoVec;
 using Nodes = std::vector<Node*>;
 using Strings = std::vector<std::string>;
