@@ -283,4 +283,24 @@ TEST_F(NodeStoreTest, HierarchyRunsFromTheStopTypeOrTheRootDownWithProgressEvent
               (Strings{"Unknown", "Tallowmere", "LAN End Point", "invalid"}));
 }
 
+// A node under two paths: each removal takes the smaller of those left,
+// whichever was computed first.
+TEST_F(NodeStoreTest, AFurtherRemovalTakesTheNextPathOfTheNode)
+{
+    ASSERT_TRUE(addNew(store, root));
+    for (bool smallerFirst : {false, true}) {
+        Node twice(ST::Fan, smallerFirst ? 1 : 2, smallerFirst ? 20 : 9, 1, "twice");
+        std::string const first = store.getNodePath(&twice);
+        twice.setNodeId(twice.getNodeId() + 1);
+        twice.setInstance(smallerFirst ? 2 : 1);
+        std::string const second = store.getNodePath(&twice);
+        std::string const& smaller = smallerFirst ? first : second;
+        std::string const& larger = smallerFirst ? second : first;
+        expectError(store.delNode(&twice), 0);
+        EXPECT_EQ(found(store, smaller, larger), (Nodes{nullptr, &twice})) << smallerFirst;
+        expectError(store.delNode(&twice), 0);
+        EXPECT_EQ(found(store, larger), Nodes{nullptr}) << smallerFirst;
+    }
+}
+
 } // namespace
