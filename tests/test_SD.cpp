@@ -1,6 +1,6 @@
-// Tests of the SD system layer: locking, events, threads, time stamps,
-// directory listings and the dynamic loader. The loader's trust policy has
-// tests of its own (test_PluginTrust).
+// Tests of the SD system layer: locking, events, threads, time stamps and
+// directory listings. The dynamic loader is tested with its trust policy
+// (test_PluginTrust).
 #include <SD/DateTime.h>
 #include <SD/DirectoryReader.h>
 #include <SD/Event.h>
@@ -12,7 +12,6 @@
 
 #include <climits>
 
-#include <dlfcn.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -244,36 +243,6 @@ TEST(SDPlatformUtilities, SeparatorAndDirectoriesFromTheEnvironmentOnEveryCall)
             EXPECT_EQ(get[i](), value.empty() ? fallback : value) << vars[i];
         }
     }
-}
-
-// A copy has its own inode, so it is loaded afresh whatever else is open.
-// (That its code stays local, its constructor runs and a refusal is one
-// error line is checked with the trust policy.)
-TEST(SDLoader, LoadsALibraryAndUnloadCloses)
-{
-    ictest::TempDir d("test_SD");
-    std::string const copy = d.path("copy.so");
-    ASSERT_TRUE(std::filesystem::copy_file(SDPROBE_PATH, copy));
-    ASSERT_EQ(symlink(copy.c_str(), d.path("link.so").c_str()), 0);
-    ictest::LogCapture cap;
-    SD::_LibraryHandle* a = SD::PlatformUtilities::loadLibrary(copy.c_str());
-    SD::_LibraryHandle* b = SD::PlatformUtilities::loadLibrary(d.path("link.so").c_str());
-    ASSERT_TRUE(a && b && a != b);
-    char missing[] = "sdprobe_no_such_function", name[] = "sdprobe_answer";
-    EXPECT_EQ(SD::PlatformUtilities::loadSymbol(a, missing), nullptr);
-    EXPECT_EQ(SD::PlatformUtilities::loadSymbol(a, nullptr), nullptr);
-    EXPECT_EQ(SD::PlatformUtilities::loadSymbol(nullptr, name), nullptr);
-    auto const answer = reinterpret_cast<int (*)()>(SD::PlatformUtilities::loadSymbol(a, name));
-    ASSERT_NE(answer, nullptr) << "a miss must not break later look-ups";
-    EXPECT_EQ(answer(), 42);
-    SD::PlatformUtilities::unloadLibrary(a);
-    EXPECT_NE(SD::PlatformUtilities::loadSymbol(b, name), nullptr) << "two handles of one library are independent";
-    SD::PlatformUtilities::unloadLibrary(b);
-    EXPECT_EQ(dlopen(copy.c_str(), RTLD_NOW | RTLD_NOLOAD), nullptr) << "unloadLibrary must close the library";
-    for (auto const& r : cap.logs())
-        EXPECT_LT(r.level, HGLog::HGLogger::LEVEL_WARNING) << r.message;
-    EXPECT_EQ(SD::PlatformUtilities::loadLibrary(nullptr), nullptr);
-    SD::PlatformUtilities::unloadLibrary(nullptr);
 }
 
 } // namespace

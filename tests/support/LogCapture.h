@@ -60,17 +60,6 @@ public:
             n += r.level == level && r.message == text;
         return n;
     }
-    // The first log-channel event whose message equals text; null if none.
-    bool find(std::string const& text, HGLog::Record* out = nullptr) const
-    {
-        for (auto const& r : logs())
-            if (r.message == text) {
-                if (out)
-                    *out = r;
-                return true;
-            }
-        return false;
-    }
     void clear()
     {
         std::lock_guard<std::mutex> g(m_);
