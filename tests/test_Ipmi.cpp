@@ -146,6 +146,7 @@ protected:
     ictest::EnvGuard dataDir_{"IC_DATA_DIR", tmp_.path("data")};
     ictest::EnvGuard config_{"IC_IPMI_CONFIG", tmp_.path("ipmi.conf")};
     ictest::EnvGuard poll_{"IC_IPMI_POLL_MS", "200"};
+    ictest::LogCapture log_; // outlives the library, whose threads log to it
     IC::InstrumentationControl* ic_ = nullptr;
     unsigned int lan_ = 0;
     std::string bmc_, section_;
@@ -216,37 +217,6 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     EXPECT_EQ(alerts(bmc_), std::vector<std::string>{});
 }
 
-// With linuxhw (loaded after ipmi, by file name) there is one ROOT and one
-// Chassis 0: linuxhw adopts what ipmi reported.
-TEST_F(IpmiTest, OneTreeWithLinuxhw)
-{
-    fs::create_symlink(LINUXHW_PLUGIN, tmp_.path("mi/linuxhw.so"));
-    ictest::EnvGuard sysfs("IC_SYSFS_ROOT", LINUXHW_EXAMPLES "/small");
-    ictest::EnvGuard poll("IC_LINUXHW_POLL_MS", "100");
-    open();
-    std::vector<Node*> all;
-    ic_->getAllNodes(all);
-    std::multiset<std::string> top;
-    for (Node* n : all)
-        if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
-            top.insert(ic_->getNodeHierarchy(n));
-    Node* bmcChassis = nullptr;
-    ASSERT_NE(byName(bmc_), nullptr);
-    ASSERT_EQ(ic_->getNode(byName(bmc_)->getLinkedId(), &bmcChassis).getStatus(), 0);
-    EXPECT_EQ(top, (std::multiset<std::string>{"ROOT:00000000", "ROOT:00000000->Chassis:00000000",
-                                               ic_->getNodeHierarchy(bmcChassis)}));
-    // ipmi removed by a reload: linuxhw announces its nodes again below a
-    // ROOT and Chassis of its own, so that none is left without its parent.
-    fs::remove(tmp_.path("mi/ipmi.so"));
-    IC::InstCtrl::TimedReload();
-    EXPECT_TRUE(ictest::eventually([&] { return byName("System Acme Computers Edge E10") != nullptr; }, kDeadlineMs));
-    Node* core = byName("CPU 0 core 0");
-    ASSERT_NE(core, nullptr);
-    EXPECT_EQ(ic_->getNodeHierarchy(core), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
-    Node* parent = nullptr;
-    EXPECT_EQ(ic_->getNode(core->getLinkedId(), &parent).getStatus(), 0);
-}
-
 // A stopped BMC: its sensors go unknown with one alert on the BMC node, and
 // Open returns within its bound; it comes back with one alert and readings.
 TEST_F(IpmiTest, StoppedBmcIsUnknownAndComesBack)
@@ -270,26 +240,20 @@ TEST_F(IpmiTest, StoppedBmcIsUnknownAndComesBack)
 
 // No /dev/ipmi0 and no configuration: loaded, no node, one information line.
 // Bad sections are each one error line naming the file and line; the good
-// BMC still loads; a wrong password is a condition on its BMC, not a crash.
-TEST_F(IpmiTest, NoBmcAndConfigurationErrorsLeaveOutOnlyTheirBmc)
+// BMC still loads; a wrong password is a condition on its BMC, not a crash;
+// with linuxhw there is one tree.
+TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
 {
     std::string const conf = tmp_.path("ipmi.conf");
-    auto logged = [](ictest::LogCapture const& log) {
-        std::vector<std::string> lines;
-        for (HGLog::Record const& r : log.logs("Helmgard.Plugins.IPMI"))
-            if (r.message.find(".conf") != std::string::npos)
-                lines.push_back(std::to_string(r.level) + " " + r.message);
-        return lines;
-    };
+    std::vector<std::string> expected;
     if (!fs::exists("/dev/ipmi0")) { // else this machine has an in-band BMC
         ictest::EnvGuard none("IC_IPMI_CONFIG", tmp_.path("missing.conf"));
-        ictest::LogCapture log;
         open();
         std::vector<Node*> all;
         ic_->getAllNodes(all);
         EXPECT_EQ(all.size(), 0u);
-        EXPECT_EQ(logged(log), std::vector<std::string>{"3000 no BMC: no /dev/ipmi0 and no BMC configured in " +
-                                                        tmp_.path("missing.conf") + "; reporting nothing"});
+        expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") +
+                           "; reporting nothing");
         close();
     }
     std::string const pw644 = secret("pw644", "icbmc-secret", 0644), wrong = secret("wrong", "nope", 0600);
@@ -301,22 +265,47 @@ TEST_F(IpmiTest, NoBmcAndConfigurationErrorsLeaveOutOnlyTheirBmc)
                             "[bmc e]\n" + host + "user = monitor\nprivilege = root\n"
                             "[bmc wrong]\n" + host + "user = monitor\npassword_file = " + wrong +
                             "\nworkarounds = opensesspriv\n" + section_);
-    ictest::LogCapture log;
+    fs::create_symlink(LINUXHW_PLUGIN, tmp_.path("mi/linuxhw.so"));
+    ictest::EnvGuard sysfs("IC_SYSFS_ROOT", LINUXHW_EXAMPLES "/small"), poll("IC_LINUXHW_POLL_MS", "100");
     open();
-    EXPECT_EQ(logged(log), (std::vector<std::string>{
-                               e + ":2: bad port in '127.0.0.1:70000'; BMC a left out",
+    std::vector<std::string> logged;
+    for (HGLog::Record const& r : log_.logs("Helmgard.Plugins.IPMI"))
+        if (r.message.find(".conf") != std::string::npos)
+            logged.push_back(std::to_string(r.level) + " " + r.message);
+    expected.insert(expected.end(), {e + ":2: bad port in '127.0.0.1:70000'; BMC a left out",
                                e + ":5: unknown key 'colour'; BMC b left out",
                                e + ":6: BMC c left out: password_file /nonexistent/pw does not exist",
                                e + ":9: BMC d left out: password_file " + pw644 + " is readable by group or others (chmod 600 it)",
-                               e + ":15: privilege must be user, operator or admin, not 'root'; BMC e left out"}));
-    std::vector<Node*> all;
-    ic_->getAllNodes(all);
-    EXPECT_EQ(std::count_if(all.begin(), all.end(), [](Node* n) { return n->getSensor() == Node::Chassis; }),
-              3); // this server's and the two BMCs'
+                               e + ":15: privilege must be user, operator or admin, not 'root'; BMC e left out"});
+    EXPECT_EQ(logged, expected);
     EXPECT_NE(byName("Inlet Temp"), nullptr);
     std::string const wrongBmc = "BMC wrong (127.0.0.1:" + std::to_string(lan_) + ")";
     EXPECT_EQ(prop(wrongBmc, "state"), "critical");
     EXPECT_NE(prop(wrongBmc, "condition").find("password"), std::string::npos) << prop(wrongBmc, "condition");
+
+    // linuxhw (loaded after ipmi, by file name) adopts the ROOT and Chassis 0.
+    std::multiset<std::string> top, roots{"ROOT:00000000", "ROOT:00000000->Chassis:00000000"};
+    std::vector<Node*> all;
+    ic_->getAllNodes(all);
+    for (Node* n : all)
+        if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
+            top.insert(ic_->getNodeHierarchy(n));
+    for (std::string const& b : {bmc_, wrongBmc}) {
+        Node* chassis = nullptr;
+        ASSERT_EQ(ic_->getNode(byName(b)->getLinkedId(), &chassis).getStatus(), 0) << b;
+        roots.insert(ic_->getNodeHierarchy(chassis));
+    }
+    EXPECT_EQ(top, roots);
+    // ipmi removed by a reload: linuxhw announces its nodes again below a
+    // ROOT and Chassis of its own, so that none is left without its parent.
+    fs::remove(tmp_.path("mi/ipmi.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return byName(bmc_) == nullptr && byName("System Acme Computers Edge E10"); }, kDeadlineMs));
+    Node* core = byName("CPU 0 core 0");
+    ASSERT_NE(core, nullptr);
+    EXPECT_EQ(ic_->getNodeHierarchy(core), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+    Node* parent = nullptr;
+    EXPECT_EQ(ic_->getNode(core->getLinkedId(), &parent).getStatus(), 0);
 }
 
 } // namespace
