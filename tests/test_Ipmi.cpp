@@ -292,6 +292,7 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
             top.insert(ic_->getNodeHierarchy(n));
     for (std::string const& b : {bmc_, wrongBmc}) {
         Node* chassis = nullptr;
+        ASSERT_NE(byName(b), nullptr) << b;
         ASSERT_EQ(ic_->getNode(byName(b)->getLinkedId(), &chassis).getStatus(), 0) << b;
         roots.insert(ic_->getNodeHierarchy(chassis));
     }
