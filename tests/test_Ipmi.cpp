@@ -301,12 +301,12 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     // ROOT and Chassis of its own, so that none is left without its parent.
     fs::remove(tmp_.path("mi/ipmi.so"));
     IC::InstCtrl::TimedReload();
-    EXPECT_TRUE(ictest::eventually([&] { return byName(bmc_) == nullptr && byName("System Acme Computers Edge E10"); }, kDeadlineMs));
-    Node* core = byName("CPU 0 core 0");
-    ASSERT_NE(core, nullptr);
-    EXPECT_EQ(ic_->getNodeHierarchy(core), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+    std::string const coreAt = "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000";
+    auto core = [&] { return byName(bmc_) ? nullptr : byName("CPU 0 core 0"); };
+    EXPECT_TRUE(ictest::eventually([&] { return core() && ic_->getNodeHierarchy(core()) == coreAt; }, kDeadlineMs));
+    ASSERT_NE(core(), nullptr);
     Node* parent = nullptr;
-    EXPECT_EQ(ic_->getNode(core->getLinkedId(), &parent).getStatus(), 0);
+    EXPECT_EQ(ic_->getNode(core()->getLinkedId(), &parent).getStatus(), 0);
 }
 
 } // namespace
