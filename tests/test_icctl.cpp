@@ -11,6 +11,8 @@
 #include <map>
 
 namespace fs = std::filesystem;
+using ictest::lines;
+using ictest::slurp;
 using nlohmann::json;
 
 namespace {
@@ -21,27 +23,12 @@ struct Result {
     std::string err;
 };
 
-std::string slurp(fs::path const& file)
-{
-    std::ifstream in(file, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 std::string quoted(std::string const& s)
 {
     std::string out = "'";
     for (char c : s)
         out += c == '\'' ? std::string("'\\''") : std::string(1, c);
     return out + "'";
-}
-
-std::vector<std::string> lines(std::string const& text)
-{
-    std::vector<std::string> out;
-    std::istringstream in(text);
-    for (std::string line; std::getline(in, line);)
-        out.push_back(line);
-    return out;
 }
 
 // Standard output of a run that must succeed.

@@ -60,11 +60,7 @@ public:
         return WIFEXITED(status_) ? WEXITSTATUS(status_) : 128 + WTERMSIG(status_);
     }
     int port() const { return port_; }
-    std::string output() const
-    {
-        std::ifstream in(log_);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
+    std::string output() const { return ictest::slurp(log_); }
     httplib::Client client() const
     {
         httplib::Client c("127.0.0.1", port_);
@@ -79,25 +75,12 @@ private:
     int status_ = 0;
 };
 
-std::string run(std::string const& cmd)
-{
-    std::string out;
-    if (FILE* p = popen(cmd.c_str(), "r")) {
-        char buf[4096];
-        for (std::size_t n; (n = fread(buf, 1, sizeof buf, p)) > 0;)
-            out.append(buf, n);
-        pclose(p);
-    }
-    return out;
-}
-
 // The events of an event-stream text, as (id, data).
 std::vector<std::pair<std::uint64_t, json>> parseEvents(std::string const& text)
 {
     std::vector<std::pair<std::uint64_t, json>> out;
-    std::istringstream in(text);
     std::uint64_t id = 0;
-    for (std::string line; std::getline(in, line);) {
+    for (std::string const& line : ictest::lines(text)) {
         if (line.rfind("id: ", 0) == 0)
             id = std::stoull(line.substr(4));
         else if (line.rfind("data: ", 0) == 0)
@@ -139,7 +122,7 @@ protected:
     }
     static std::string icctl(std::string const& command)
     {
-        return run(std::string(ICCTL_BINARY) + " --json --mi-dir " + dir_->path("mi") + " --fp-dir " +
+        return ictest::run(std::string(ICCTL_BINARY) + " --json --mi-dir " + dir_->path("mi") + " --fp-dir " +
                    dir_->path("fp") + " --sysfs-root " + dir_->path("root") + " " + command);
     }
     static void setTemperature(int milli)
