@@ -17,11 +17,7 @@ using nlohmann::json;
 
 namespace {
 
-struct Result {
-    int status; // 128 + signal when a signal ended it
-    std::string out;
-    std::string err;
-};
+struct Result { int status; std::string out, err; };
 
 std::string quoted(std::string const& s)
 {
@@ -43,9 +39,7 @@ std::vector<json> jsonLines(std::string const& text)
 {
     std::vector<json> out;
     for (std::string const& line : lines(text))
-        out.push_back(json::parse(line));
-    for (json& j : out)
-        j.erase("time");
+        out.emplace_back(json::parse(line)).erase("time");
     return out;
 }
 
@@ -244,12 +238,8 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
     useFakeHw();
     std::string const nope = (dir_ / "nope").string();
     std::string const file = (mi_ / "fakehw.so").string();
-    struct Case {
-        bool dirs; // with --mi-dir and --fp-dir
-        std::vector<std::string> args;
-        int status;
-        std::string err;
-    } const cases[] = {
+    // dirs: with --mi-dir and --fp-dir
+    struct Case { bool dirs; std::vector<std::string> args; int status; std::string err; } const cases[] = {
         {true, {"nodes", "--sensor", "Warp Core"}, 2, "icctl: unknown sensor type 'Warp Core' (give a "
          "name such as \"Temperature Sensor\" or a number; 'icctl sensors' lists them)\n"},
         {true, {"nodes", "--sensor", "74"}, 2, "icctl: sensor type 74 is out of range (0..73)\n"},
@@ -339,13 +329,9 @@ TEST_F(Icctl, HostileNamesAreEscapedInEveryOutput)
              fs::copy_options::recursive | fs::copy_options::copy_symlinks);
     fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
     fs::path const cls = dir_ / "root/sys/class";
-    struct Case {
-        fs::path file;           // written with raw, or renamed to raw when rename
-        std::string raw;         // the hostile name
-        bool rename;
-        std::string line, shown; // a line of the tree starts with line and holds shown
-        std::string json;        // the description JSON gives back ("" when not UTF-8)
-    } const cases[] = {
+    // file is written with the hostile name raw, or renamed to it when rename; a line of the tree starts
+    // with line and holds shown; json is the description JSON gives back ("" when not UTF-8).
+    struct Case { fs::path file; std::string raw; bool rename; std::string line, shown, json; } const cases[] = {
         {dir_ / "root/proc/sys/kernel/hostname", "rack\x1b[2Jforged", false, "ROOT 0: ",
          "Linux host rack\\x1b[2Jforged  [1f5c]", "Linux host rack\x1b[2Jforged"},
         {cls / "dmi/id/product_name", "R720\x1b]0;title\x07", false, "  Chassis 0: ",

@@ -141,13 +141,9 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
     httplib::Headers many;
     for (int i = 0; i < 70; ++i)
         many.emplace("X-Filler-" + std::to_string(i), "1");
-    struct Case {
-        std::string method, target;
-        httplib::Headers headers;
-        int status;
-        std::string type;                  // content-type prefix
-        std::vector<std::string> contains; // in the body
-    } const cases[] = {
+    // type: a prefix of the content type; contains: texts in the body
+    struct Case { std::string method, target; httplib::Headers headers; int status; std::string type;
+                  std::vector<std::string> contains; } const cases[] = {
         {"GET", "/metrics", {}, 200, "text/plain; version=0.0.4",
          {"# TYPE ic_sensor_value gauge\n",
           "ic_sensor_value{path=\"" + kTemp + "\",type=\"22\",type_name=\"Temperature Sensor\",instance=\"1\","
@@ -298,10 +294,8 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
     Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}),
                 dir_->path("guarded.log"));
     ASSERT_NE(guarded.port(), 0) << guarded.output();
-    struct Case {
-        std::string user, password;
-        int status;
-    } const cases[] = {{"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
+    struct Case { std::string user, password; int status; } const cases[] = {
+        {"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
     for (Case const& c : cases) {
         httplib::Client client = guarded.client();
         if (!c.user.empty())
