@@ -252,22 +252,17 @@ TEST_F(LinuxHwTest, ThermalZonesStandInWhenThereIsNoHwmon)
 
 TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChange)
 {
-    // A condition present at start is on the node from the start, for the
-    // functional plug-ins to assert: no poll raises it again.
-    useTree("small");
-    write("sys/class/hwmon/hwmon0/temp1_input", "85000");
-    open();
+    open("small");
     std::string const pkg = pathOf(kPackage);
-    EXPECT_EQ(prop(kPackage, "state"), "warning");
-    EXPECT_EQ(prop(kPackage, "condition"), "CPU 0 Package id 0 temperature 85.0 C above warning 80.0 C");
+    std::string const warning = "5/2/1/CPU 0 Package id 0 temperature 100.0 C above warning 80.0 C";
     // At the critical limit is not above it.
     write("sys/class/hwmon/hwmon0/temp1_input", "100000");
-    EXPECT_TRUE(eventually([&] { return prop(kPackage, "reading") == "100.0 C"; }));
+    expectAlerts(pkg, {warning});
     std::string const critical = "5/3/2/CPU 0 Package id 0 temperature 101.0 C above critical 100.0 C";
     write("sys/class/hwmon/hwmon0/temp1_input", "101000");
-    expectAlerts(pkg, {critical});
+    expectAlerts(pkg, {warning, critical});
     write("sys/class/hwmon/hwmon0/temp1_input", "45000");
-    expectAlerts(pkg, {critical, "5/1/0/CPU 0 Package id 0 temperature back to normal at 45.0 C"});
+    expectAlerts(pkg, {warning, critical, "5/1/0/CPU 0 Package id 0 temperature back to normal at 45.0 C"});
     EXPECT_EQ(prop(kPackage, "state"), "ok");
 
     std::string const core = pathOf("CPU 0 Core 1 temperature");

@@ -88,7 +88,23 @@ protected:
     fs::path dir_ = tmp_.root(), mi_, fp_;
 };
 
-TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
+TEST_F(Icctl, EmptyResultsSensorsAndTheVerboseLog)
+{
+    EXPECT_EQ(out(icctl({"tree"})), "No nodes: no management interface reported any hardware.\n");
+    EXPECT_EQ(out(icctl({"alerts"})), "No asserted alerts.\n");
+    useFakeHw();
+    EXPECT_EQ(out(icctl({"nodes", "--sensor", "DIMM"})), "No nodes of type DIMM.\n");
+    json const sensors = json::parse(out(bare({"sensors", "--json"}))).at("sensors");
+    ASSERT_EQ(sensors.size(), 74u);
+    EXPECT_EQ(sensors[73], json({{"type", 73}, {"name", "LAN End Point"}}));
+    EXPECT_EQ(icctl({"nodes"}).err, "");
+    Result const loud = icctl({"-v", "nodes", "--json"});
+    EXPECT_NE(loud.err.find("Helmgard.IC.Health"), std::string::npos) << loud.err;
+    // Standard output stays one clean document.
+    EXPECT_EQ(json::parse(loud.out).at("count"), 6);
+}
+
+TEST_F(Icctl, TreeNodesAndShowDescribeEveryNode)
 {
     useFakeHw();
     // Siblings by sensor type: CPU (4), Network Port (12), Fan (20).
@@ -110,19 +126,8 @@ TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
     expected.update({{"path", kTemp}, {"parent", kCpu}, {"reading", {{"value", "45"}, {"unit", "C"}}},
                      {"state", "ok"}, {"children", json::array()}});
     EXPECT_EQ(temp, expected);
-}
 
-TEST_F(Icctl, EmptyResultsAreSaidInWords)
-{
-    EXPECT_EQ(out(icctl({"tree"})), "No nodes: no management interface reported any hardware.\n");
-    EXPECT_EQ(out(icctl({"alerts"})), "No asserted alerts.\n");
-    useFakeHw();
-    EXPECT_EQ(out(icctl({"nodes", "--sensor", "DIMM"})), "No nodes of type DIMM.\n");
-}
-
-TEST_F(Icctl, NodesListsEveryNodeOrOneSensorType)
-{
-    useFakeHw();
+    // nodes: every node, or one sensor type.
     std::vector<std::string> const l = lines(out(icctl({"nodes"})));
     ASSERT_EQ(l.size(), 7u);
     EXPECT_EQ(l[0], "PATH                TYPE                INSTANCE  DESCRIPTION      READING   STATE");
@@ -133,16 +138,12 @@ TEST_F(Icctl, NodesListsEveryNodeOrOneSensorType)
         ASSERT_EQ(doc.at("count"), 1) << spelling;
         EXPECT_EQ(doc.at("nodes")[0].at("path"), kTemp);
     }
-}
-
-TEST_F(Icctl, ShowGivesPropertiesHierarchyChildrenAndAlerts)
-{
-    useFakeHw();
-    json const doc = json::parse(out(icctl({"show", "1F2B01F501F201F5C0", "--json"})));
-    EXPECT_EQ(doc.at("path"), kTemp);
-    EXPECT_EQ(doc.at("hierarchy"), kHierarchy);
-    EXPECT_EQ(doc.at("properties")[1], json({{"name", "upper_critical"}, {"value", "95"}, {"unit", "C"}}));
-    EXPECT_TRUE(doc.at("children").empty() && doc.at("alerts").empty());
+    // show: properties, hierarchy, children and alerts.
+    json const shown = json::parse(out(icctl({"show", "1F2B01F501F201F5C0", "--json"})));
+    EXPECT_EQ(shown.at("path"), kTemp);
+    EXPECT_EQ(shown.at("hierarchy"), kHierarchy);
+    EXPECT_EQ(shown.at("properties")[1], json({{"name", "upper_critical"}, {"value", "95"}, {"unit", "C"}}));
+    EXPECT_TRUE(shown.at("children").empty() && shown.at("alerts").empty());
     EXPECT_EQ(out(icctl({"show", kChassis})),
               "path         " + kChassis + "\ntype         Chassis (1)\ninstance     0\n"
               "description  Fake chassis\nnode id      0x00010002\nnode number  65538\n"
@@ -287,20 +288,6 @@ TEST_F(Icctl, FailedOpenGivesTheLoadCode)
     Result const noFp = icctl({"alerts"});
     EXPECT_EQ(noFp.status, 3);
     EXPECT_NE(noFp.err.find("load code 31 (functional plug-ins failed to load)"), std::string::npos) << noFp.err;
-}
-
-TEST_F(Icctl, HelpSensorsAndTheVerboseLog)
-{
-    json const sensors = json::parse(out(bare({"sensors", "--json"}))).at("sensors");
-    ASSERT_EQ(sensors.size(), 74u);
-    EXPECT_EQ(sensors[73], json({{"type", 73}, {"name", "LAN End Point"}}));
-
-    useFakeHw();
-    EXPECT_EQ(icctl({"nodes"}).err, "");
-    Result const loud = icctl({"-v", "nodes", "--json"});
-    EXPECT_NE(loud.err.find("Helmgard.IC.Health"), std::string::npos) << loud.err;
-    // Standard output stays one clean document.
-    EXPECT_EQ(json::parse(loud.out).at("count"), 6);
 }
 
 } // namespace
