@@ -38,8 +38,8 @@ protected:
     HealthTest()
     {
         ictest::Recorder::get().reset();
-        fs::create_directories(mi_);
-        fs::create_directories(fp_);
+        for (fs::path const& d : {mi_, fp_})
+            fs::create_directories(d);
         fs::create_symlink(FAKEHW_PLUGIN, mi_ / "fakehw.so");
         addHealth();
     }

@@ -84,11 +84,7 @@ protected:
                 return n->getPath();
         return "<no node " + description + ">";
     }
-    Node* node(std::string const& path) const
-    {
-        Node* n = nullptr;
-        return ic_->getNode(path, &n).getStatus() == 0 ? n : nullptr;
-    }
+    Node* node(std::string const& path) const { Node* n = nullptr; return ic_->getNode(path, &n).getStatus() ? nullptr : n; }
     // "value unit" of a property of the node with that description.
     std::string prop(std::string const& description, std::string const& name) const
     {

@@ -274,22 +274,20 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
 
 TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
 {
-    Icd open(args({"--listen", "0.0.0.0:0"}), dir_->path("open.log"));
-    EXPECT_EQ(open.stop(), 2);
-    EXPECT_NE(open.output().find("refusing to listen on 0.0.0.0:0 without --web-config"), std::string::npos)
-        << open.output();
+    auto refuses = [](std::vector<std::string> const& more, std::string const& why) {
+        Icd icd(args(more), dir_->path("refused.log"));
+        EXPECT_EQ(icd.stop(), 2);
+        EXPECT_NE(icd.output().find(why), std::string::npos) << icd.output();
+    };
+    refuses({"--listen", "0.0.0.0:0"}, "refusing to listen on 0.0.0.0:0 without --web-config");
+    std::string const bad = dir_->write("bad.yml", "basic_auth_users:\n  prom: plaintext\n");
+    refuses({"--listen", "127.0.0.1:0", "--web-config", bad},
+            "bad.yml:2: the password of 'prom' is not a bcrypt or SHA-crypt hash");
 
     crypt_data data{};
-    std::string const hash = crypt_r("s3cret", crypt_gensalt_rn("$2b$", 5, nullptr, 0,
-                                                                  data.setting, sizeof data.setting),
-                                     &data);
+    std::string const hash =
+        crypt_r("s3cret", crypt_gensalt_rn("$2b$", 5, nullptr, 0, data.setting, sizeof data.setting), &data);
     std::string const config = dir_->write("web.yml", "basic_auth_users:\n  prom: " + hash + "\n");
-    std::string const bad = dir_->write("bad.yml", "basic_auth_users:\n  prom: plaintext\n");
-    Icd refused(args({"--listen", "127.0.0.1:0", "--web-config", bad}), dir_->path("refused.log"));
-    EXPECT_EQ(refused.stop(), 2);
-    EXPECT_NE(refused.output().find("bad.yml:2: the password of 'prom' is not a bcrypt or SHA-crypt hash"),
-              std::string::npos)
-        << refused.output();
 
     Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}),
                 dir_->path("guarded.log"));
