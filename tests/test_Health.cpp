@@ -38,8 +38,8 @@ protected:
     HealthTest()
     {
         ictest::Recorder::get().reset();
-        fs::create_directories(mi_);
-        fs::create_directories(fp_);
+        for (fs::path const& d : {mi_, fp_})
+            fs::create_directories(d);
         fs::create_symlink(FAKEHW_PLUGIN, mi_ / "fakehw.so");
         addHealth();
     }
@@ -154,15 +154,9 @@ TEST_F(HealthTest, RollUpCarriesTheWorstAssertedCondition)
     std::string const temp = " on " + ic_->pathToPrintablePath(temp_) + ": ";
     std::string const fan = " on " + ic_->pathToPrintablePath(fan_) + ": ";
     std::string const two = "health: 2 asserted alerts, worst ";
-    struct Step {
-        Node::SensorType type;
-        unsigned char severity;
-        unsigned int status;
-        char const* message;
-        std::size_t count; // roll-ups so far, the last one:
-        unsigned char rollupSeverity;
-        unsigned int rollupStatus;
-        std::string rollupMessage;
+    // A raise, then how many roll-ups so far and the last one.
+    struct Step { Node::SensorType type; unsigned char severity; unsigned int status; char const* message;
+                  std::size_t count; unsigned char rollupSeverity; unsigned int rollupStatus; std::string rollupMessage;
     } const steps[] = {
         {Node::Fan, 1, 2, "fan slow", 1, 1, 2, "health: 1 asserted alert, worst warning" + fan + "fan slow"},
         {Node::Fan, 1, 2, "fan still slow", 1, 1, 2, "health: 1 asserted alert, worst warning" + fan + "fan slow"},

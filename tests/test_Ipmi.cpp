@@ -21,6 +21,7 @@ namespace {
 namespace fs = std::filesystem;
 using IC::Alert;
 using IC::Node;
+using ictest::run;
 
 constexpr int kDeadlineMs = 15000; // a sanitizer build on a busy 2-core machine
 
@@ -38,18 +39,6 @@ unsigned int freePort(int type)
         port = ntohs(a.sin_port);
     ::close(fd);
     return port;
-}
-
-std::string run(std::string const& command)
-{
-    std::string out;
-    if (FILE* p = ::popen(command.c_str(), "r")) {
-        char buf[4096];
-        while (std::size_t n = std::fread(buf, 1, sizeof buf, p))
-            out.append(buf, n);
-        ::pclose(p);
-    }
-    return out;
 }
 
 class IpmiTest : public ::testing::Test {

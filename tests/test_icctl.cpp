@@ -11,21 +11,13 @@
 #include <map>
 
 namespace fs = std::filesystem;
+using ictest::lines;
+using ictest::slurp;
 using nlohmann::json;
 
 namespace {
 
-struct Result {
-    int status; // 128 + signal when a signal ended it
-    std::string out;
-    std::string err;
-};
-
-std::string slurp(fs::path const& file)
-{
-    std::ifstream in(file, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-}
+struct Result { int status; std::string out, err; };
 
 std::string quoted(std::string const& s)
 {
@@ -33,15 +25,6 @@ std::string quoted(std::string const& s)
     for (char c : s)
         out += c == '\'' ? std::string("'\\''") : std::string(1, c);
     return out + "'";
-}
-
-std::vector<std::string> lines(std::string const& text)
-{
-    std::vector<std::string> out;
-    std::istringstream in(text);
-    for (std::string line; std::getline(in, line);)
-        out.push_back(line);
-    return out;
 }
 
 // Standard output of a run that must succeed.
@@ -56,9 +39,7 @@ std::vector<json> jsonLines(std::string const& text)
 {
     std::vector<json> out;
     for (std::string const& line : lines(text))
-        out.push_back(json::parse(line));
-    for (json& j : out)
-        j.erase("time");
+        out.emplace_back(json::parse(line)).erase("time");
     return out;
 }
 
@@ -107,7 +88,23 @@ protected:
     fs::path dir_ = tmp_.root(), mi_, fp_;
 };
 
-TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
+TEST_F(Icctl, EmptyResultsSensorsAndTheVerboseLog)
+{
+    EXPECT_EQ(out(icctl({"tree"})), "No nodes: no management interface reported any hardware.\n");
+    EXPECT_EQ(out(icctl({"alerts"})), "No asserted alerts.\n");
+    useFakeHw();
+    EXPECT_EQ(out(icctl({"nodes", "--sensor", "DIMM"})), "No nodes of type DIMM.\n");
+    json const sensors = json::parse(out(bare({"sensors", "--json"}))).at("sensors");
+    ASSERT_EQ(sensors.size(), 74u);
+    EXPECT_EQ(sensors[73], json({{"type", 73}, {"name", "LAN End Point"}}));
+    EXPECT_EQ(icctl({"nodes"}).err, "");
+    Result const loud = icctl({"-v", "nodes", "--json"});
+    EXPECT_NE(loud.err.find("Helmgard.IC.Health"), std::string::npos) << loud.err;
+    // Standard output stays one clean document.
+    EXPECT_EQ(json::parse(loud.out).at("count"), 6);
+}
+
+TEST_F(Icctl, TreeNodesAndShowDescribeEveryNode)
 {
     useFakeHw();
     // Siblings by sensor type: CPU (4), Network Port (12), Fan (20).
@@ -129,19 +126,8 @@ TEST_F(Icctl, TreeShowsEachNodeUnderItsParent)
     expected.update({{"path", kTemp}, {"parent", kCpu}, {"reading", {{"value", "45"}, {"unit", "C"}}},
                      {"state", "ok"}, {"children", json::array()}});
     EXPECT_EQ(temp, expected);
-}
 
-TEST_F(Icctl, EmptyResultsAreSaidInWords)
-{
-    EXPECT_EQ(out(icctl({"tree"})), "No nodes: no management interface reported any hardware.\n");
-    EXPECT_EQ(out(icctl({"alerts"})), "No asserted alerts.\n");
-    useFakeHw();
-    EXPECT_EQ(out(icctl({"nodes", "--sensor", "DIMM"})), "No nodes of type DIMM.\n");
-}
-
-TEST_F(Icctl, NodesListsEveryNodeOrOneSensorType)
-{
-    useFakeHw();
+    // nodes: every node, or one sensor type.
     std::vector<std::string> const l = lines(out(icctl({"nodes"})));
     ASSERT_EQ(l.size(), 7u);
     EXPECT_EQ(l[0], "PATH                TYPE                INSTANCE  DESCRIPTION      READING   STATE");
@@ -152,16 +138,12 @@ TEST_F(Icctl, NodesListsEveryNodeOrOneSensorType)
         ASSERT_EQ(doc.at("count"), 1) << spelling;
         EXPECT_EQ(doc.at("nodes")[0].at("path"), kTemp);
     }
-}
-
-TEST_F(Icctl, ShowGivesPropertiesHierarchyChildrenAndAlerts)
-{
-    useFakeHw();
-    json const doc = json::parse(out(icctl({"show", "1F2B01F501F201F5C0", "--json"})));
-    EXPECT_EQ(doc.at("path"), kTemp);
-    EXPECT_EQ(doc.at("hierarchy"), kHierarchy);
-    EXPECT_EQ(doc.at("properties")[1], json({{"name", "upper_critical"}, {"value", "95"}, {"unit", "C"}}));
-    EXPECT_TRUE(doc.at("children").empty() && doc.at("alerts").empty());
+    // show: properties, hierarchy, children and alerts.
+    json const shown = json::parse(out(icctl({"show", "1F2B01F501F201F5C0", "--json"})));
+    EXPECT_EQ(shown.at("path"), kTemp);
+    EXPECT_EQ(shown.at("hierarchy"), kHierarchy);
+    EXPECT_EQ(shown.at("properties")[1], json({{"name", "upper_critical"}, {"value", "95"}, {"unit", "C"}}));
+    EXPECT_TRUE(shown.at("children").empty() && shown.at("alerts").empty());
     EXPECT_EQ(out(icctl({"show", kChassis})),
               "path         " + kChassis + "\ntype         Chassis (1)\ninstance     0\n"
               "description  Fake chassis\nnode id      0x00010002\nnode number  65538\n"
@@ -178,10 +160,9 @@ TEST_F(Icctl, AlertsListsWhatIsAsserted)
     json const doc = json::parse(out(icctl({"alerts", "--wait", "1.5", "--json"})));
     ASSERT_EQ(doc.at("count"), 2) << doc.dump(2);
     std::map<std::string, json> byPath;
-    for (json a : doc.at("alerts")) {
-        a.erase("time");
+    for (json const& a : doc.at("alerts"))
         byPath[a.at("paths").at(0)] = a;
-    }
+    byPath[kTemp].erase("time");
     EXPECT_EQ(byPath[kTemp], json({{"severity", 2}, {"severityName", "critical"}, {"class", 5},
                                    {"className", "threshold"}, {"status", 3}, {"statusName", "critical"},
                                    {"paths", {kTemp}}, {"message", "CPU temperature 97 C above 95 C"},
@@ -257,12 +238,8 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
     useFakeHw();
     std::string const nope = (dir_ / "nope").string();
     std::string const file = (mi_ / "fakehw.so").string();
-    struct Case {
-        bool dirs; // with --mi-dir and --fp-dir
-        std::vector<std::string> args;
-        int status;
-        std::string err;
-    } const cases[] = {
+    // dirs: with --mi-dir and --fp-dir
+    struct Case { bool dirs; std::vector<std::string> args; int status; std::string err; } const cases[] = {
         {true, {"nodes", "--sensor", "Warp Core"}, 2, "icctl: unknown sensor type 'Warp Core' (give a "
          "name such as \"Temperature Sensor\" or a number; 'icctl sensors' lists them)\n"},
         {true, {"nodes", "--sensor", "74"}, 2, "icctl: sensor type 74 is out of range (0..73)\n"},
@@ -312,20 +289,6 @@ TEST_F(Icctl, FailedOpenGivesTheLoadCode)
     EXPECT_NE(noFp.err.find("load code 31 (functional plug-ins failed to load)"), std::string::npos) << noFp.err;
 }
 
-TEST_F(Icctl, HelpSensorsAndTheVerboseLog)
-{
-    json const sensors = json::parse(out(bare({"sensors", "--json"}))).at("sensors");
-    ASSERT_EQ(sensors.size(), 74u);
-    EXPECT_EQ(sensors[73], json({{"type", 73}, {"name", "LAN End Point"}}));
-
-    useFakeHw();
-    EXPECT_EQ(icctl({"nodes"}).err, "");
-    Result const loud = icctl({"-v", "nodes", "--json"});
-    EXPECT_NE(loud.err.find("Helmgard.IC.Health"), std::string::npos) << loud.err;
-    // Standard output stays one clean document.
-    EXPECT_EQ(json::parse(loud.out).at("count"), 6);
-}
-
 } // namespace
 
 #ifdef LINUXHW_PLUGIN
@@ -352,13 +315,9 @@ TEST_F(Icctl, HostileNamesAreEscapedInEveryOutput)
              fs::copy_options::recursive | fs::copy_options::copy_symlinks);
     fs::create_symlink(LINUXHW_PLUGIN, mi_ / "linuxhw.so");
     fs::path const cls = dir_ / "root/sys/class";
-    struct Case {
-        fs::path file;           // written with raw, or renamed to raw when rename
-        std::string raw;         // the hostile name
-        bool rename;
-        std::string line, shown; // a line of the tree starts with line and holds shown
-        std::string json;        // the description JSON gives back ("" when not UTF-8)
-    } const cases[] = {
+    // file is written with the hostile name raw, or renamed to it when rename; a line of the tree starts
+    // with line and holds shown; json is the description JSON gives back ("" when not UTF-8).
+    struct Case { fs::path file; std::string raw; bool rename; std::string line, shown, json; } const cases[] = {
         {dir_ / "root/proc/sys/kernel/hostname", "rack\x1b[2Jforged", false, "ROOT 0: ",
          "Linux host rack\\x1b[2Jforged  [1f5c]", "Linux host rack\x1b[2Jforged"},
         {cls / "dmi/id/product_name", "R720\x1b]0;title\x07", false, "  Chassis 0: ",

@@ -60,11 +60,7 @@ public:
         return WIFEXITED(status_) ? WEXITSTATUS(status_) : 128 + WTERMSIG(status_);
     }
     int port() const { return port_; }
-    std::string output() const
-    {
-        std::ifstream in(log_);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
+    std::string output() const { return ictest::slurp(log_); }
     httplib::Client client() const
     {
         httplib::Client c("127.0.0.1", port_);
@@ -79,25 +75,12 @@ private:
     int status_ = 0;
 };
 
-std::string run(std::string const& cmd)
-{
-    std::string out;
-    if (FILE* p = popen(cmd.c_str(), "r")) {
-        char buf[4096];
-        for (std::size_t n; (n = fread(buf, 1, sizeof buf, p)) > 0;)
-            out.append(buf, n);
-        pclose(p);
-    }
-    return out;
-}
-
 // The events of an event-stream text, as (id, data).
 std::vector<std::pair<std::uint64_t, json>> parseEvents(std::string const& text)
 {
     std::vector<std::pair<std::uint64_t, json>> out;
-    std::istringstream in(text);
     std::uint64_t id = 0;
-    for (std::string line; std::getline(in, line);) {
+    for (std::string const& line : ictest::lines(text)) {
         if (line.rfind("id: ", 0) == 0)
             id = std::stoull(line.substr(4));
         else if (line.rfind("data: ", 0) == 0)
@@ -139,7 +122,7 @@ protected:
     }
     static std::string icctl(std::string const& command)
     {
-        return run(std::string(ICCTL_BINARY) + " --json --mi-dir " + dir_->path("mi") + " --fp-dir " +
+        return ictest::run(std::string(ICCTL_BINARY) + " --json --mi-dir " + dir_->path("mi") + " --fp-dir " +
                    dir_->path("fp") + " --sysfs-root " + dir_->path("root") + " " + command);
     }
     static void setTemperature(int milli)
@@ -158,13 +141,9 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
     httplib::Headers many;
     for (int i = 0; i < 70; ++i)
         many.emplace("X-Filler-" + std::to_string(i), "1");
-    struct Case {
-        std::string method, target;
-        httplib::Headers headers;
-        int status;
-        std::string type;                  // content-type prefix
-        std::vector<std::string> contains; // in the body
-    } const cases[] = {
+    // type: a prefix of the content type; contains: texts in the body
+    struct Case { std::string method, target; httplib::Headers headers; int status; std::string type;
+                  std::vector<std::string> contains; } const cases[] = {
         {"GET", "/metrics", {}, 200, "text/plain; version=0.0.4",
          {"# TYPE ic_sensor_value gauge\n",
           "ic_sensor_value{path=\"" + kTemp + "\",type=\"22\",type_name=\"Temperature Sensor\",instance=\"1\","
@@ -295,30 +274,26 @@ TEST_F(IcdTest, EventStreamDeliversInOrderReplaysAndSurvivesAStuckClient)
 
 TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
 {
-    Icd open(args({"--listen", "0.0.0.0:0"}), dir_->path("open.log"));
-    EXPECT_EQ(open.stop(), 2);
-    EXPECT_NE(open.output().find("refusing to listen on 0.0.0.0:0 without --web-config"), std::string::npos)
-        << open.output();
+    auto refuses = [](std::vector<std::string> const& more, std::string const& why) {
+        Icd icd(args(more), dir_->path("refused.log"));
+        EXPECT_EQ(icd.stop(), 2);
+        EXPECT_NE(icd.output().find(why), std::string::npos) << icd.output();
+    };
+    refuses({"--listen", "0.0.0.0:0"}, "refusing to listen on 0.0.0.0:0 without --web-config");
+    std::string const bad = dir_->write("bad.yml", "basic_auth_users:\n  prom: plaintext\n");
+    refuses({"--listen", "127.0.0.1:0", "--web-config", bad},
+            "bad.yml:2: the password of 'prom' is not a bcrypt or SHA-crypt hash");
 
     crypt_data data{};
-    std::string const hash = crypt_r("s3cret", crypt_gensalt_rn("$2b$", 5, nullptr, 0,
-                                                                  data.setting, sizeof data.setting),
-                                     &data);
+    std::string const hash =
+        crypt_r("s3cret", crypt_gensalt_rn("$2b$", 5, nullptr, 0, data.setting, sizeof data.setting), &data);
     std::string const config = dir_->write("web.yml", "basic_auth_users:\n  prom: " + hash + "\n");
-    std::string const bad = dir_->write("bad.yml", "basic_auth_users:\n  prom: plaintext\n");
-    Icd refused(args({"--listen", "127.0.0.1:0", "--web-config", bad}), dir_->path("refused.log"));
-    EXPECT_EQ(refused.stop(), 2);
-    EXPECT_NE(refused.output().find("bad.yml:2: the password of 'prom' is not a bcrypt or SHA-crypt hash"),
-              std::string::npos)
-        << refused.output();
 
     Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}),
                 dir_->path("guarded.log"));
     ASSERT_NE(guarded.port(), 0) << guarded.output();
-    struct Case {
-        std::string user, password;
-        int status;
-    } const cases[] = {{"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
+    struct Case { std::string user, password; int status; } const cases[] = {
+        {"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
     for (Case const& c : cases) {
         httplib::Client client = guarded.client();
         if (!c.user.empty())

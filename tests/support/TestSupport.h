@@ -173,6 +173,32 @@ struct JoinedThread : std::thread {
     }
 };
 
+// A file's bytes; the standard output of a shell command; a text's lines.
+inline std::string slurp(std::filesystem::path const& file)
+{
+    std::ifstream in(file, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+inline std::string run(std::string const& command)
+{
+    std::string out;
+    if (FILE* p = ::popen(command.c_str(), "r")) {
+        char buf[4096];
+        for (std::size_t n; (n = std::fread(buf, 1, sizeof buf, p)) > 0;)
+            out.append(buf, n);
+        ::pclose(p);
+    }
+    return out;
+}
+inline std::vector<std::string> lines(std::string const& text)
+{
+    std::vector<std::string> out;
+    std::istringstream in(text);
+    for (std::string line; std::getline(in, line);)
+        out.push_back(line);
+    return out;
+}
+
 // Polls until pred holds; false when ms passed first.
 template <class Pred>
 bool eventually(Pred pred, int ms = 5000)
