@@ -93,6 +93,6 @@ trap "icd_stop_quietly; ${cleanup:-}" EXIT
 icd_start build/icd.log "${icd[@]}"
 curl -fsS --max-time 10 -o build/icd-metrics.txt "$icd_url/metrics"
 echo "icd answered at $icd_url/ (page), $icd_url/metrics, $icd_url/api/v1/nodes"
-grep -v '^#' build/icd-metrics.txt | head -n 8
+awk '!/^#/ && n++ < 8' build/icd-metrics.txt
 echo "... $(grep -vc '^#' build/icd-metrics.txt) samples; scripts/run.sh --serve keeps icd running"
 icd_stop
