@@ -13,6 +13,7 @@
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/epoll.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -101,6 +102,23 @@ std::vector<std::string> largeServer(std::vector<std::string> more = {})
                                EXAMPLES_DIR "/large", "--listen", "127.0.0.1:0"};
     a.insert(a.end(), more.begin(), more.end());
     return a;
+}
+
+// A loopback connection that has asked for the event stream; a small
+// receive buffer makes a reader that never reads stall its sender sooner.
+int openEventStream(int port, int receiveBuffer = 0)
+{
+    int const fd = socket(AF_INET, SOCK_STREAM, 0);
+    if (receiveBuffer > 0)
+        setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &receiveBuffer, sizeof receiveBuffer);
+    sockaddr_in addr{};
+    addr.sin_family = AF_INET;
+    addr.sin_port = htons(static_cast<std::uint16_t>(port));
+    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    std::string const get = "GET /api/v1/events HTTP/1.1\r\nHost: x\r\n\r\n";
+    benchmark::DoNotOptimize(write(fd, get.data(), get.size()));
+    return fd;
 }
 
 double scrapeSeconds(std::string const& body)
@@ -195,61 +213,81 @@ void BM_EventStream(benchmark::State& state)
                    {"BENCH_ALERT_TRIGGER=" + trigger});
         int stuck = -1;
         if (state.range(0) == 1) {
-            stuck = socket(AF_INET, SOCK_STREAM, 0);
-            int small = 4096;
-            setsockopt(stuck, SOL_SOCKET, SO_RCVBUF, &small, sizeof small);
-            sockaddr_in addr{};
-            addr.sin_family = AF_INET;
-            addr.sin_port = htons(static_cast<std::uint16_t>(icd.port()));
-            addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-            connect(stuck, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-            std::string const get = "GET /api/v1/events HTTP/1.1\r\nHost: x\r\n\r\n";
-            benchmark::DoNotOptimize(write(stuck, get.data(), get.size()));
+            stuck = openEventStream(icd.port(), 4096);
         }
-        std::atomic<int> connected{0}, complete{0};
-        std::vector<std::vector<double>> latencies(kSubscribers);
-        std::vector<std::thread> subscribers;
-        for (int s = 0; s < kSubscribers; ++s)
-            subscribers.emplace_back([&, s] {
-                httplib::Client client("127.0.0.1", icd.port());
-                client.set_read_timeout(30);
-                std::string pending;
-                long expected = 0;
-                bool first = true;
-                client.Get("/api/v1/events", [&](char const* data, std::size_t n) {
-                    if (first) {
-                        first = false;
+        // One reader for all subscribers, so that the client side adds no
+        // scheduling of its own to what is measured.
+        struct Subscriber {
+            int fd;
+            std::string pending;
+            long expected = 0;
+            bool connected = false, failed = false;
+            std::vector<double> latencies;
+        };
+        std::vector<Subscriber> subs(kSubscribers);
+        int const ep = epoll_create1(0);
+        for (Subscriber& sub : subs) {
+            sub.fd = openEventStream(icd.port());
+            epoll_event ev{};
+            ev.events = EPOLLIN;
+            ev.data.ptr = &sub;
+            epoll_ctl(ep, EPOLL_CTL_ADD, sub.fd, &ev);
+        }
+        int connected = 0, open = kSubscribers;
+        bool triggered = false;
+        std::vector<epoll_event> ready(kSubscribers);
+        char buf[65536];
+        auto const limit = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+        while (open > 0 && std::chrono::steady_clock::now() < limit) {
+            if (!triggered && connected == kSubscribers) {
+                std::ofstream(trigger) << kAlerts << " 100\n";
+                triggered = true;
+            }
+            int const n = epoll_wait(ep, ready.data(), kSubscribers, 1000);
+            for (int i = 0; i < n; ++i) {
+                auto& sub = *static_cast<Subscriber*>(ready[static_cast<std::size_t>(i)].data.ptr);
+                ssize_t const got = read(sub.fd, buf, sizeof buf);
+                if (got <= 0) {
+                    sub.failed = true;
+                } else {
+                    long long const now = monotonicNs();
+                    sub.pending.append(buf, static_cast<std::size_t>(got));
+                    if (!sub.connected && sub.pending.find(": connected") != std::string::npos) {
+                        sub.connected = true;
                         ++connected;
                     }
-                    pending.append(data, n);
                     std::size_t begin = 0;
-                    for (std::size_t end; (end = pending.find("\n\n", begin)) != std::string::npos;
+                    for (std::size_t end; (end = sub.pending.find("\n\n", begin)) != std::string::npos;
                          begin = end + 2) {
-                        auto const at = pending.find("\"message\":\"seq ", begin);
+                        auto const at = sub.pending.find("\"message\":\"seq ", begin);
                         if (at == std::string::npos || at > end)
                             continue;
                         char* next = nullptr;
-                        long const seq = std::strtol(pending.c_str() + at + 15, &next, 10);
+                        long const seq = std::strtol(sub.pending.c_str() + at + 15, &next, 10);
                         long long const sent = std::strtoll(next, nullptr, 10);
-                        if (seq != expected)
-                            return false; // out of order or lost: not complete
-                        ++expected;
-                        latencies[static_cast<std::size_t>(s)].push_back(
-                            static_cast<double>(monotonicNs() - sent) / 1e6);
+                        if (seq != sub.expected) {
+                            sub.failed = true; // out of order or lost: not complete
+                            break;
+                        }
+                        ++sub.expected;
+                        sub.latencies.push_back(static_cast<double>(now - sent) / 1e6);
                     }
-                    pending.erase(0, begin);
-                    if (expected == kAlerts)
-                        ++complete;
-                    return expected < kAlerts;
-                });
-            });
-        // Every subscriber's first keep-alive says its stream is open.
-        for (auto limit = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-             connected < kSubscribers && std::chrono::steady_clock::now() < limit;)
-            std::this_thread::sleep_for(std::chrono::milliseconds(10));
-        std::ofstream(trigger) << kAlerts << " 100\n";
-        for (auto& t : subscribers)
-            t.join();
+                    sub.pending.erase(0, begin);
+                }
+                if (sub.failed || sub.expected == kAlerts) {
+                    epoll_ctl(ep, EPOLL_CTL_DEL, sub.fd, nullptr);
+                    --open;
+                }
+            }
+        }
+        close(ep);
+        int complete = 0;
+        std::vector<std::vector<double>> latencies;
+        for (Subscriber& sub : subs) {
+            close(sub.fd);
+            complete += sub.expected == kAlerts ? 1 : 0;
+            latencies.push_back(std::move(sub.latencies));
+        }
         if (stuck >= 0)
             close(stuck);
         std::vector<double> all;
@@ -259,7 +297,7 @@ void BM_EventStream(benchmark::State& state)
         auto pct = [&all](double p) {
             return all.empty() ? 0.0 : all[static_cast<std::size_t>(p * static_cast<double>(all.size() - 1))];
         };
-        state.counters["complete_subscribers"] = complete.load();
+        state.counters["complete_subscribers"] = complete;
         state.counters["p50_ms"] = pct(0.50);
         state.counters["p99_ms"] = pct(0.99);
         state.counters["max_ms"] = pct(1.0);

@@ -1,8 +1,41 @@
 #include "EventRing.h"
 
+#include <sys/eventfd.h>
+#include <unistd.h>
+
 namespace icd {
 
-EventRing::EventRing(std::size_t capacity) : capacity_(capacity == 0 ? 1 : capacity) {}
+void appendEventText(std::string& out, std::vector<Event> const& events, std::uint64_t missed)
+{
+    if (missed != 0)
+        out += ": missed " + std::to_string(missed) + " events\n\n";
+    for (Event const& e : events) {
+        out += "id: ";
+        out += std::to_string(e.id);
+        out += "\nevent: alert\ndata: ";
+        out += *e.data;
+        out += "\n\n";
+    }
+}
+
+EventRing::EventRing(std::size_t capacity)
+    : capacity_(capacity == 0 ? 1 : capacity), wake_(eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC))
+{
+}
+
+EventRing::~EventRing()
+{
+    if (wake_ >= 0)
+        ::close(wake_);
+}
+
+void EventRing::wake() const
+{
+    std::uint64_t const one = 1;
+    if (wake_ >= 0 && ::write(wake_, &one, sizeof one) < 0) {
+        // Full counter (EAGAIN): the reader has a wake-up pending anyway.
+    }
+}
 
 std::uint64_t EventRing::push(std::string data)
 {
@@ -15,16 +48,29 @@ std::uint64_t EventRing::push(std::string data)
         events_.push_back(Event{id, std::make_shared<std::string const>(std::move(data))});
     }
     arrived_.notify_all();
+    wake();
     return id;
 }
 
 bool EventRing::readAfter(std::uint64_t after, std::chrono::milliseconds wait,
                           std::vector<Event>& out, std::uint64_t* missed)
 {
-    out.clear();
-    *missed = 0;
     std::unique_lock<std::mutex> g(lock_);
     arrived_.wait_for(g, wait, [&] { return closed_ || lastId_ > after; });
+    return collectLocked(after, out, missed);
+}
+
+bool EventRing::collect(std::uint64_t after, std::vector<Event>& out, std::uint64_t* missed) const
+{
+    std::lock_guard<std::mutex> g(lock_);
+    return collectLocked(after, out, missed);
+}
+
+bool EventRing::collectLocked(std::uint64_t after, std::vector<Event>& out,
+                              std::uint64_t* missed) const
+{
+    out.clear();
+    *missed = 0;
     if (closed_)
         return false;
     if (events_.empty() || lastId_ <= after)
@@ -44,12 +90,19 @@ void EventRing::close()
         closed_ = true;
     }
     arrived_.notify_all();
+    wake();
 }
 
 std::uint64_t EventRing::lastId() const
 {
     std::lock_guard<std::mutex> g(lock_);
     return lastId_;
+}
+
+bool EventRing::closed() const
+{
+    std::lock_guard<std::mutex> g(lock_);
+    return closed_;
 }
 
 } // namespace icd

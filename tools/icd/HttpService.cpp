@@ -25,6 +25,7 @@ namespace {
 constexpr std::size_t kMaxHeaders = 64;
 constexpr std::size_t kMaxPayload = 8 * 1024;
 constexpr std::size_t kMaxPathText = 512;
+constexpr int kTimeoutSeconds = 5; // to read a request, to write a response
 
 void jsonError(httplib::Response& res, int status, std::string const& message)
 {
@@ -119,8 +120,8 @@ std::vector<std::string> HttpService::start()
         server->set_tcp_nodelay(true); // a response is one write; waiting for an ACK costs 40 ms
         server->set_keep_alive_max_count(100);
         server->set_keep_alive_timeout(5);
-        server->set_read_timeout(5);
-        server->set_write_timeout(5);
+        server->set_read_timeout(kTimeoutSeconds);
+        server->set_write_timeout(kTimeoutSeconds);
         if (host.find(':') != std::string::npos)
             server->set_address_family(AF_INET6);
         addRoutes(*server);
@@ -133,6 +134,8 @@ std::vector<std::string> HttpService::start()
                        std::to_string(bound) + "/");
         servers_.push_back(std::move(server));
     }
+    streams_ = std::make_unique<EventStreams>(ring_, options_.keepAlive,
+                                              std::chrono::seconds(kTimeoutSeconds));
     for (auto& s : servers_)
         threads_.emplace_back([server = s.get()] { server->listen_after_bind(); });
     return urls;
@@ -141,12 +144,15 @@ std::vector<std::string> HttpService::start()
 void HttpService::stop()
 {
     ring_.close(); // ends every event stream's wait
+    if (streams_)
+        streams_->stop();
     for (auto& s : servers_)
         s->stop();
     for (std::thread& t : threads_)
         t.join();
     threads_.clear();
     servers_.clear();
+    streams_.reset();
 }
 
 bool HttpService::admit(httplib::Request const& req, httplib::Response& res) const
@@ -297,14 +303,25 @@ void HttpService::events(httplib::Request const& req, httplib::Response& res)
     }
     res.set_header("Cache-Control", "no-cache");
     res.set_header("X-Accel-Buffering", "no");
+    // A plain connection's socket goes to the one writer; TLS has to write
+    // through the connection's own session, so it keeps its thread.
+    int const fd = req.ssl ? -1
+                           : connectionSocket(req.local_addr, req.local_port, req.remote_addr,
+                                              req.remote_port);
     auto next = std::make_shared<std::uint64_t>(after);
     res.set_chunked_content_provider(
         "text/event-stream",
-        [this, next](std::size_t offset, httplib::DataSink& sink) {
+        [this, next, fd](std::size_t offset, httplib::DataSink& sink) {
             if (offset == 0) {
                 // At once, so that the client knows the stream is open.
                 static char const opened[] = ": connected\nretry: 2000\n\n";
                 return sink.write(opened, sizeof opened - 1);
+            }
+            if (fd >= 0) {
+                if (streams_->serve(fd, *next) == EventStreams::Outcome::Gone)
+                    return false;
+                sink.done();
+                return true;
             }
             std::vector<Event> events;
             std::uint64_t missed = 0;
@@ -313,10 +330,7 @@ void HttpService::events(httplib::Request const& req, httplib::Response& res)
                 return true;
             }
             std::string out;
-            if (missed != 0)
-                out += ": missed " + std::to_string(missed) + " events\n\n";
-            for (Event const& e : events)
-                out += "id: " + std::to_string(e.id) + "\nevent: alert\ndata: " + *e.data + "\n\n";
+            appendEventText(out, events, missed);
             if (out.empty())
                 out = ": keep-alive\n\n";
             if (!events.empty())

@@ -4,6 +4,7 @@
 
 #include "AlertFeed.h"
 #include "EventRing.h"
+#include "EventStreams.h"
 #include "WebConfig.h"
 
 #include <IC/InstrumentationControl.h>
@@ -59,6 +60,7 @@ private:
     EventRing& ring_;
     ServiceOptions const options_;
     std::atomic<std::size_t> subscribers_{0};
+    std::unique_ptr<EventStreams> streams_; // plain-HTTP subscribers; TLS ones keep their thread
     std::vector<std::unique_ptr<httplib::Server>> servers_;
     std::vector<std::thread> threads_;
 };
