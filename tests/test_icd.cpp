@@ -146,11 +146,11 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
                   std::vector<std::string> contains; } const cases[] = {
         {"GET", "/metrics", {}, 200, "text/plain; version=0.0.4",
          {"# TYPE ic_sensor_value gauge\n",
-          "ic_sensor_value{path=\"" + kTemp + "\",type=\"22\",type_name=\"Temperature Sensor\",instance=\"1\","
+          "ic_sensor_value{path=\"" + kTemp + "\",type=\"22\",type_name=\"Temperature Sensor\",node_instance=\"1\","
           "description=\"CPU 0 Package id 0 temperature\",unit=\"celsius\"} ",
           "ic_sensor_threshold{path=\"" + kTemp + "\",", "kind=\"upper_critical\"} 100\n",
           "ic_node_state{path=\"" + kTemp + "\",", "ic_node_info{path=\"1f201f5c\",",
-          "ic_node_info{path=\"1f5c\",type=\"59\",type_name=\"ROOT\",instance=\"0\","
+          "ic_node_info{path=\"1f5c\",type=\"59\",type_name=\"ROOT\",node_instance=\"0\","
           "description=\"Linux host rack\\\"7\\\\x1b\",parent=\"\"} 1\n", "vendor=\"Acme Computers\"",
           "ic_plugins_loaded{kind=\"mi\"} 1\n", "ic_plugins_loaded{kind=\"fp\"} 1\n",
           "ic_plugin_load_failures_total 0\n", "ic_alerts_asserted{severity=\"critical\"} ",

@@ -77,7 +77,7 @@ std::string nodeLabels(IC::InstrumentationControl& ic, IC::Node const& n)
 {
     return "path=\"" + ic.pathToPrintablePath(n.getPath()) + "\",type=\"" +
            std::to_string(static_cast<unsigned int>(n.getSensor())) + "\",type_name=\"" +
-           escapeLabel(ictools::sensorName(n.getSensor())) + "\",instance=\"" +
+           escapeLabel(ictools::sensorName(n.getSensor())) + "\",node_instance=\"" +
            std::to_string(n.getInstance()) + "\",description=\"" +
            escapeLabel(n.getDescription()) + "\"";
 }
