@@ -64,6 +64,7 @@ unset IC_MI_DIR IC_FP_DIR IC_DATA_DIR IC_SYSFS_ROOT HGLOG_CONFIG
 ic_expect "$("$root/usr/bin/icctl" --sysfs-root "$large" tree)" "installed icctl tree" \
   '^ROOT' 'Temperature Sensor' 'Fan'
 ic_expect "$("$root/usr/bin/icd" --version)" "icd --version" "${version//./\\.}"
+ic_expect "$("$root/usr/bin/icctl" --version)" "icctl --version" "${version//./\\.}"
 
 ic_start_icd "$root/usr/bin/icd" --sysfs-root "$large"
 ic_expect "$(curl -fsS --max-time 10 "$icd_url/metrics")" "installed icd /metrics" \

@@ -48,6 +48,7 @@ int run(int argc, char** argv)
     // Global options may also follow the subcommand ("icctl tree --json").
     app.fallthrough();
     app.require_subcommand(1);
+    app.set_version_flag("--version", "icctl " ICCTL_VERSION);
 
     GlobalOptions g;
     app.add_option("--mi-dir", g.miDir,
