@@ -55,7 +55,7 @@ if [[ $quick -eq 0 ]]; then
 fi
 
 if [[ $tsan -eq 1 ]]; then
-  export TSAN_OPTIONS="halt_on_error=1:second_deadlock_stack=1:detect_deadlocks=1"
+  export TSAN_OPTIONS="halt_on_error=1:second_deadlock_stack=1:detect_deadlocks=1:suppressions=$PWD/scripts/tsan.supp"
   # The installed-package test only rebuilds the consumer; it says nothing
   # about threads.
   build_and_test tsan -LE 'package|soak-long' -- -DIC_SANITIZE=thread

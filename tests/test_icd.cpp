@@ -109,7 +109,7 @@ protected:
     }
     static void TearDownTestSuite()
     {
-        EXPECT_EQ(icd_->stop(), 0);
+        EXPECT_EQ(icd_->stop(), 0) << icd_->output();
         delete icd_;
         delete dir_;
     }
@@ -302,7 +302,7 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
         ASSERT_TRUE(res);
         EXPECT_EQ(res->status, c.status) << c.user << ":" << c.password;
     }
-    EXPECT_EQ(guarded.stop(), 0);
+    EXPECT_EQ(guarded.stop(), 0) << guarded.output();
 }
 
 } // namespace

@@ -16,6 +16,7 @@
 #include <memory>
 #include <mutex>
 #include <shared_mutex>
+#include <thread>
 #include <unordered_map>
 
 namespace HGLog {
@@ -165,7 +166,12 @@ public:
         if (listener)
             next = std::make_shared<Listener const>(std::move(listener));
         hasListener_.store(static_cast<bool>(next), std::memory_order_release);
-        std::atomic_store(&listener_, next);
+        std::shared_ptr<Listener const> const previous = std::atomic_exchange(&listener_, next);
+        // Whoever set the old listener may destroy what it captured once this
+        // returns: wait for the calls still running it. No new call can take
+        // it after the exchange, so its count only falls.
+        while (previous && previous.use_count() > 1)
+            std::this_thread::yield();
     }
 
     bool hasListener() const { return hasListener_.load(std::memory_order_acquire); }

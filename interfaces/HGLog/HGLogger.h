@@ -59,6 +59,8 @@ public:
     // While a listener is set, every event of both channels reaches it,
     // whatever the configured levels. An empty function removes it. The
     // listener is called on the logging thread and must not set a listener.
+    // Returns once no thread runs the replaced listener any more, so that
+    // its owner may go.
     static void setListener(Listener listener);
 
     // Replaces the configuration with a log4cxx properties file. Returns false

@@ -3,6 +3,7 @@
 #include "Log.h"
 
 #include <dirent.h>
+#include <fcntl.h>
 #include <netdb.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
@@ -12,6 +13,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <map>
 
 namespace icd {
@@ -57,6 +59,11 @@ int connectionSocket(std::string const& localAddr, int localPort, std::string co
         char* end = nullptr;
         long const fd = std::strtol(e->d_name, &end, 10);
         if (*end != '\0' || end == e->d_name || fd == listing)
+            continue;
+        // Only sockets, told by their link text: no call on anyone else's descriptor.
+        char link[32];
+        ssize_t const n = readlinkat(listing, e->d_name, link, sizeof link);
+        if (n < 8 || std::memcmp(link, "socket:[", 8) != 0)
             continue;
         sockaddr_storage peer{}, self{};
         socklen_t peerLen = sizeof peer, selfLen = sizeof self;
@@ -114,14 +121,23 @@ void EventStreams::stop()
 
 EventStreams::Outcome EventStreams::serve(int fd, std::uint64_t after)
 {
+    // A descriptor of our own for the same connection: the writer then
+    // never touches a number that httplib may close and the system reuse.
+    int const own = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (own < 0) {
+        ICD_LOG(6000, "event stream: cannot take the connection (errno ", errno, ")");
+        return Outcome::Gone;
+    }
     auto s = std::make_unique<Subscriber>();
-    s->fd = fd;
+    s->fd = own;
     s->next = after;
     std::future<Outcome> done = s->done.get_future();
     {
         std::lock_guard<std::mutex> g(lock_);
-        if (stopping_)
+        if (stopping_) {
+            ::close(own);
             return Outcome::Closed;
+        }
         incoming_.push_back(std::move(s));
     }
     std::uint64_t const one = 1;
@@ -153,6 +169,7 @@ void EventStreams::adopt(Clock::time_point now)
         ev.data.ptr = s.get();
         if (epoll_ctl(epoll_, EPOLL_CTL_ADD, s->fd, &ev) != 0) {
             ICD_LOG(6000, "event stream: cannot watch a subscriber's socket (errno ", errno, ")");
+            ::close(s->fd);
             s->done.set_value(Outcome::Gone);
             continue;
         }
@@ -225,7 +242,10 @@ void EventStreams::flush(Subscriber& s, Clock::time_point now)
 
 void EventStreams::finish(std::list<std::unique_ptr<Subscriber>>::iterator it, Outcome outcome)
 {
+    // Removed by hand: closing a duplicate leaves the connection in the set
+    // while httplib's descriptor still holds it.
     epoll_ctl(epoll_, EPOLL_CTL_DEL, (*it)->fd, nullptr);
+    ::close((*it)->fd);
     // A chunk cut short leaves the framing broken: only a whole stream can end cleanly.
     if (outcome == Outcome::Closed && !(*it)->out.empty())
         outcome = Outcome::Gone;

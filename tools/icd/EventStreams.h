@@ -36,7 +36,7 @@ public:
 
     // Streams the events after `after` as HTTP chunks on the connected socket
     // fd (its response head already sent) until one of the outcomes. The
-    // socket stays the caller's; it is only written with MSG_DONTWAIT.
+    // writer sends on a duplicate of fd, with MSG_DONTWAIT, and closes it.
     Outcome serve(int fd, std::uint64_t after);
 
     // Ends every stream (Closed) and the writer; serve returns at once after.

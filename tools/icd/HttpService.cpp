@@ -13,7 +13,9 @@
 
 #include <httplib.h>
 
+#include <fcntl.h>
 #include <sys/socket.h>
+#include <unistd.h>
 
 #include <cctype>
 #include <functional>
@@ -51,12 +53,20 @@ char const* reason(int status)
 
 // httplib listens with a backlog of 5: a burst of clients (a hundred event
 // streams reconnecting after a restart) would wait for SYN retries of 1 s
-// and more. Listening again on the bound socket widens the queue.
+// and more. Listening again on the bound socket widens the queue; through a
+// duplicate, so that only httplib ever uses its own descriptor.
 template <class Base>
 class Listener : public Base {
 public:
     using Base::Base;
-    void widenBacklog() { ::listen(this->svr_sock_, SOMAXCONN); }
+    void widenBacklog()
+    {
+        int const own = fcntl(this->svr_sock_, F_DUPFD_CLOEXEC, 0);
+        if (own >= 0) {
+            ::listen(own, SOMAXCONN);
+            ::close(own);
+        }
+    }
 };
 
 } // namespace
