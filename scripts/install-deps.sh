@@ -15,7 +15,7 @@ packages=(
   liblog4cxx-dev
   libcli11-dev nlohmann-json3-dev
   libbenchmark-dev
-  libcpp-httplib-dev libssl-dev libcrypt-dev
+  libcpp-httplib-dev libssl-dev libcrypt-dev libsystemd-dev
   dpkg-dev curl jq
   openipmi freeipmi-tools libipmimonitoring-dev libfreeipmi-dev
 )

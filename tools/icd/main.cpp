@@ -17,6 +17,9 @@
 
 #include <malloc.h>
 #include <signal.h>
+#ifdef ICD_SYSTEMD
+#include <systemd/sd-daemon.h>
+#endif
 
 #include <iostream>
 #include <memory>
@@ -28,6 +31,17 @@ namespace {
 using namespace ictools;
 
 constexpr std::size_t kEventRing = 4096; // events a reconnecting client can catch up on
+
+// Tells systemd (Type=notify) that icd listens, reloads or stops; nothing
+// outside a unit that asks for it.
+void notifyService(char const* state)
+{
+#ifdef ICD_SYSTEMD
+    sd_notify(0, state);
+#else
+    (void)state;
+#endif
+}
 
 struct Options {
     GlobalOptions global;
@@ -154,6 +168,7 @@ int run(int argc, char** argv)
     for (std::string const& url : urls)
         std::cout << "icd: listening on " << url << std::endl;
     ICD_LOG(3000, "serving on ", urls.size(), " address(es)");
+    notifyService("READY=1");
 
     for (;;) {
         int sig = 0;
@@ -161,10 +176,13 @@ int run(int argc, char** argv)
             continue;
         if (sig == SIGHUP) {
             ICD_LOG(3000, "SIGHUP: looking for plug-ins added or removed");
+            notifyService("RELOADING=1");
             Plugins::reload();
+            notifyService("READY=1");
             continue;
         }
         ICD_LOG(3000, "signal ", sig, ": stopping");
+        notifyService("STOPPING=1");
         break;
     }
     service.stop();
