@@ -37,6 +37,9 @@ is "document.querySelectorAll('#alerts .alert').length" "$at_start" || ic_fail "
 ic_overheat
 ic_wait_until "the alert in the page" is "document.querySelector('#alerts .alert[data-path=\"$hot\"]') !== null" true
 ic_wait_until "the critical state in the tree" is "$row.classList.contains('state-critical')" true
+# The chassis row shows the roll-up, turned critical by the overheat.
+ic_wait_until "the roll-up on the chassis row" is \
+  "document.querySelector('#tree .node[data-path=\"1f201f5c\"]').classList.contains('rollup-critical')" true
 # The chassis' health roll-up follows; the page lists what the API does.
 ic_wait_until "the page's alerts to match the API's" is "document.querySelectorAll('#alerts .alert').length" \
   "$(sleep 1; curl -fsS "$icd_url/api/v1/alerts" | jq .count)"

@@ -2,7 +2,8 @@
 // from the server is placed with textContent, never parsed as HTML.
 //
 // Stable hooks for scripts and tests: #tree (the nodes, each an element
-// .node[data-path] with a .state-ok/-warning/-critical/-unknown class), #alerts
+// .node[data-path] with a .state-ok/-warning/-critical/-unknown class, and
+// .rollup-warning/-critical where the health roll-up is asserted), #alerts
 // (one .alert[data-path] per asserted alert), #status ("N events received").
 #pragma once
 
@@ -27,6 +28,8 @@ ul { list-style: none; padding-left: 1.2em; margin: 0; }
 .state-warning > .row { border-color: #e90; background: #fff6e0; }
 .state-critical > .row { border-color: #d22; background: #ffe8e8; }
 .state-unknown > .row { border-color: #999; }
+.rollup-warning > .row { border-color: #e90; background: #fff6e0; }
+.rollup-critical > .row { border-color: #d22; background: #ffe8e8; }
 table { border-collapse: collapse; } td, th { padding: 2px 8px; text-align: left; border-bottom: 1px solid #eee; }
 .alert.sev-critical, .alert.sev-fatal { background: #ffe8e8; } .alert.sev-warning { background: #fff6e0; }
 </style>
@@ -40,7 +43,7 @@ table { border-collapse: collapse; } td, th { padding: 2px 8px; text-align: left
 <div id="tree"></div>
 <script>
 "use strict";
-let events = 0, pending = null;
+let events = 0, pending = null, rollups = [];
 function el(tag, cls, text) {
   const e = document.createElement(tag);
   if (cls) e.className = cls;
@@ -77,6 +80,7 @@ async function loadTree() {
   const tree = document.getElementById("tree");
   tree.replaceChildren(ul);
   tree.dataset.count = doc.count;
+  paintRollups();
   if (doc.nodes.length && doc.nodes[0].typeName === "ROOT") document.getElementById("host").textContent = doc.nodes[0].description;
 }
 async function loadAlerts() {
@@ -91,6 +95,16 @@ async function loadAlerts() {
     body.appendChild(tr);
   });
   document.getElementById("alerts").dataset.count = doc.count;
+  rollups = doc.alerts.filter(a => a.className === "health-rollup");
+  paintRollups();
+}
+// The chassis has no state of its own: its row shows the health roll-up.
+function paintRollups() {
+  document.querySelectorAll(".rollup-warning, .rollup-critical").forEach(li => li.classList.remove("rollup-warning", "rollup-critical"));
+  rollups.forEach(a => a.paths.forEach(p => {
+    const li = document.querySelector('#tree li[data-path="' + CSS.escape(p) + '"]');
+    if (li && (a.severityName === "warning" || a.severityName === "critical")) li.classList.add("rollup-" + a.severityName);
+  }));
 }
 function refresh() {
   if (pending) return;
