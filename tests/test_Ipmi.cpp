@@ -15,6 +15,7 @@
 #include <unistd.h>
 
 #include <map>
+#include <utility>
 
 namespace {
 
@@ -89,12 +90,7 @@ protected:
             ASSERT_EQ(IC::InstCtrl::regFPsensorAlerts(ictest::recAlert, static_cast<Node::SensorType>(t), this)
                           .getStatus(), 0);
     }
-    void close()
-    {
-        if (ic_)
-            Unloadlib();
-        ic_ = nullptr;
-    }
+    void close() { if (std::exchange(ic_, nullptr)) Unloadlib(); }
 
     Node* byName(std::string const& description) const
     {
@@ -104,6 +100,11 @@ protected:
             if (n->getDescription() == description)
                 return n;
         return nullptr;
+    }
+    Node* parentOf(std::string const& description) const
+    {
+        Node* p = nullptr;
+        return byName(description) && ic_->getNode(byName(description)->getLinkedId(), &p).getStatus() == 0 ? p : nullptr;
     }
     std::string prop(std::string const& description, std::string const& name) const
     {
@@ -148,7 +149,7 @@ protected:
 TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
 {
     open();
-    std::istringstream in(run("ipmi-sensors -h 127.0.0.1:" + std::to_string(lan_) +
+    std::vector<std::string> const table = ictest::lines(run("ipmi-sensors -h 127.0.0.1:" + std::to_string(lan_) +
                               " -u monitor -p icbmc-secret -W opensesspriv -l operator --quiet-cache "
                               "--sdr-cache-directory " + tmp_.path("cache") + " --output-sensor-thresholds "
                               "--comma-separated-output --no-header-output --output-sensor-state"));
@@ -159,8 +160,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     // ID,Name,Type,State,Reading,Units,Lower NR,Lower C,Lower NC,Upper NC,Upper C,Upper NR,Event
     std::pair<int, char const*> const columns[] = {
         {4, "reading"}, {7, "lower_critical"}, {8, "lower_warning"}, {9, "upper_warning"}, {10, "upper_critical"}};
-    int sensors = 0;
-    for (std::string line; std::getline(in, line); ++sensors) {
+    for (std::string const& line : table) {
         std::vector<std::string> f;
         std::istringstream cells(line);
         for (std::string c; std::getline(cells, c, ',');)
@@ -177,11 +177,21 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
                 EXPECT_NEAR(std::stod(prop(f[1], name)), std::stod(f[col]), 0.005) << f[1] << " " << name;
         EXPECT_EQ(prop(f[1], "condition_class"), f[3] == "Nominal" ? "-" : "5") << f[1];
     }
-    EXPECT_EQ(sensors, 8);
+    EXPECT_EQ(table.size(), 8u);
     Node* bmc = byName(bmc_);
     ASSERT_NE(bmc, nullptr);
     EXPECT_EQ(ic_->getNodeHierarchy(bmc).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(bmc);
-    EXPECT_EQ(byName("Inlet Temp")->getLinkedId(), bmc->getLinkedId());
+    // Sensors below their entity's node, which has the entity's FRU inventory.
+    std::pair<char const*, char const*> const entities[] = {{"CPU1 Temp", "Processor 1: - - -"}, {"PS2 Status",
+        "Power Supply 2: Voltra VP-800 PSU2-0043"}, {"Inlet Temp", "System Board 1: Icebox Systems ICB-2U Board BRD0001234"}};
+    for (auto const& [sensor, entity] : entities) {
+        Node* e = parentOf(sensor);
+        ASSERT_NE(e, nullptr) << sensor;
+        std::string const d = e->getDescription();
+        EXPECT_EQ(d + ": " + prop(d, "vendor") + " " + prop(d, "model") + " " + prop(d, "serial"), entity);
+        EXPECT_EQ(e->getLinkedId(), bmc->getLinkedId()) << sensor;
+    }
+    std::string const ps2 = byName("PS2 Status")->getPath();
     EXPECT_EQ(prop(bmc_, "version") + " " + prop(bmc_, "ipmi_version"), "9.08 2.0"); // as bmc-info says
 
     std::pair<char const*, char const*> const steps[] = {
@@ -204,6 +214,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     open();
     std::this_thread::sleep_for(std::chrono::milliseconds(1000)); // five polls
     EXPECT_EQ(alerts(bmc_), std::vector<std::string>{});
+    EXPECT_EQ(byName("PS2 Status")->getPath(), ps2);
 }
 
 // A stopped BMC: its sensors go unknown with one alert on the BMC node, and
@@ -279,12 +290,8 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     for (Node* n : all)
         if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
             top.insert(ic_->getNodeHierarchy(n));
-    for (std::string const& b : {bmc_, wrongBmc}) {
-        Node* chassis = nullptr;
-        ASSERT_NE(byName(b), nullptr) << b;
-        ASSERT_EQ(ic_->getNode(byName(b)->getLinkedId(), &chassis).getStatus(), 0) << b;
-        roots.insert(ic_->getNodeHierarchy(chassis));
-    }
+    for (std::string const& b : {bmc_, wrongBmc})
+        roots.insert(parentOf(b) ? ic_->getNodeHierarchy(parentOf(b)) : "no chassis above " + b);
     EXPECT_EQ(top, roots);
     // ipmi removed by a reload: linuxhw announces its nodes again below a
     // ROOT and Chassis of its own, so that none is left without its parent.
@@ -293,9 +300,7 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     std::string const coreAt = "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000";
     auto core = [&] { return byName(bmc_) ? nullptr : byName("CPU 0 core 0"); };
     EXPECT_TRUE(ictest::eventually([&] { return core() && ic_->getNodeHierarchy(core()) == coreAt; }, kDeadlineMs));
-    ASSERT_NE(core(), nullptr);
-    Node* parent = nullptr;
-    EXPECT_EQ(ic_->getNode(core()->getLinkedId(), &parent).getStatus(), 0);
+    EXPECT_NE(parentOf("CPU 0 core 0"), nullptr);
 }
 
 } // namespace

@@ -8,6 +8,8 @@
 
 #include <SD/PlatformUtilities.h>
 
+#include <freeipmi/freeipmi.h>
+
 #include <sys/stat.h>
 
 #include <cstdio>
@@ -59,6 +61,27 @@ Node::SensorType typeOf(int ipmiType)
     case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG1:
     case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG2: return Node::BMC;
     default: return Node::PFASensor;
+    }
+}
+
+// The node type of an IPMI entity that gets a node of its own, grouping its
+// sensors and carrying its FRU inventory (README.md has the table); Unknown
+// for the others, whose sensors hang below the chassis.
+Node::SensorType entityTypeOf(unsigned int entityId)
+{
+    switch (entityId) {
+    case IPMI_ENTITY_ID_PROCESSOR:
+    case IPMI_ENTITY_ID_PROCESSOR_MODULE: return Node::CPU;
+    case IPMI_ENTITY_ID_SYSTEM_BOARD: return Node::Planar;
+    case IPMI_ENTITY_ID_MEMORY_MODULE:
+    case IPMI_ENTITY_ID_MEMORY_DEVICE: return Node::DIMM;
+    case IPMI_ENTITY_ID_POWER_SUPPLY:
+    case IPMI_ENTITY_ID_POWER_MODULE_DC_TO_DC_CONVERTER: return Node::PowerSupply;
+    case IPMI_ENTITY_ID_POWER_UNIT_POWER_DOMAIN: return Node::PowerDomain;
+    case IPMI_ENTITY_ID_COOLING_UNIT_COOLING_DOMAIN: return Node::CoolingDomain;
+    case IPMI_ENTITY_ID_FRONT_PANEL_BOARD: return Node::FrontPanel;
+    case IPMI_ENTITY_ID_BACK_PANEL_BOARD: return Node::BackPanel;
+    default: return Node::Unknown;
     }
 }
 
@@ -288,13 +311,13 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
         auto it = b.sensors.find(key);
         if (it == b.sensors.end()) {
             Node::SensorType const type = typeOf(s.type);
+            Node const* entity = entityNode(b, s.entityId, s.entityInstance, out);
+            unsigned int const parent = entity ? entity->getNodeId() : b.parentId;
             // Identity from facts that survive restarts and SDR reorders:
             // entity id, entity instance and name, never the record id.
-            unsigned int instance = digest(key);
-            while (!b.instances.emplace(type, instance).second)
-                ++instance;
+            unsigned int const instance = claimInstance(b, parent, type, digest(key));
             it = b.sensors.emplace(key, Tracked()).first;
-            it->second.node = newNode(type, instance, b.parentId, s.name);
+            it->second.node = newNode(type, instance, parent, s.name);
             it->second.node->setProperty("entity", std::to_string(s.entityId) + "." + std::to_string(s.entityInstance));
             if (mapped_)
                 out.arrivals.push_back(it->second.node);
@@ -313,6 +336,15 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
                                     s.state + (s.event.empty() ? "" : ": " + s.event);
         judge(it->second, s.state, message, out);
     }
+    if (!b.inventoryShown && !b.reader->inventory().empty()) {
+        b.inventoryShown = true;
+        for (Inventory const& item : b.reader->inventory())
+            if (Node* n = entityNode(b, item.entityId, item.entityInstance, out))
+                for (auto const& [name, value] : {std::pair{"vendor", &item.vendor}, {"model", &item.model},
+                                                  {"serial", &item.serial}})
+                    if (!value->empty())
+                        n->setProperty(name, *value);
+    }
     std::string const bmcPath = b.bmcNode.node->knownPath();
     for (SelEvent const& e : events) {
         unsigned char const severity = e.state == IPMI_MONITORING_STATE_CRITICAL  ? shipped::kSeverityCritical
@@ -323,6 +355,36 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
             out.alerts.emplace_back(severity, shipped::kEventLog, std::vector<std::string>{bmcPath},
                                     shipped::kStatusNormal, b.label + " " + e.text);
     }
+}
+
+unsigned int IpmiMI::claimInstance(Bmc& b, unsigned int parent, Node::SensorType type, unsigned int wanted)
+{
+    while (!b.instances.emplace(parent, type, wanted).second)
+        wanted = (wanted + 1) & 0xFFFF;
+    return wanted;
+}
+
+IpmiMI::Node* IpmiMI::entityNode(Bmc& b, unsigned int entityId, unsigned int entityInstance, Outbox& out)
+{
+    Node::SensorType const type = entityTypeOf(entityId);
+    if (type == Node::Unknown)
+        return nullptr;
+    auto const key = std::make_pair(entityId, entityInstance);
+    if (auto const found = b.entities.find(key); found != b.entities.end())
+        return found->second;
+    // The entity's own instance number; two entities of one node type with
+    // the same number (a processor and a processor module) keep both facts.
+    unsigned int const wanted = b.instances.count({b.parentId, type, entityInstance}) == 0
+                                    ? entityInstance
+                                    : (entityId << 8 | entityInstance);
+    char const* name = ipmi_get_entity_id_string(static_cast<uint8_t>(entityId));
+    Node* n = newNode(type, claimInstance(b, b.parentId, type, wanted), b.parentId,
+                      std::string(name ? name : "Entity") + " " + std::to_string(entityInstance));
+    n->setProperty("entity", std::to_string(entityId) + "." + std::to_string(entityInstance));
+    b.entities.emplace(key, n);
+    if (mapped_)
+        out.arrivals.push_back(n);
+    return n;
 }
 
 void IpmiMI::deliver(Outbox& out)

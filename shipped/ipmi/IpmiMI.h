@@ -27,6 +27,7 @@
 #include <set>
 #include <string>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 namespace ipmi {
@@ -65,7 +66,9 @@ private:
         unsigned int parentId = 0; // where its nodes hang
         Tracked bmcNode;
         std::map<std::string, Tracked> sensors; // by identity
-        std::set<std::pair<unsigned int, unsigned int>> instances; // (type, instance) taken
+        std::map<std::pair<unsigned int, unsigned int>, Node*> entities; // by (entity id, instance)
+        std::set<std::tuple<unsigned int, unsigned int, unsigned int>> instances; // (parent, type, instance) taken
+        bool inventoryShown = false;
         bool reachable = true;
         unsigned int failures = 0;
         std::chrono::steady_clock::time_point nextTry{};
@@ -79,6 +82,8 @@ private:
     void run();
     void pass();
     void readBmc(Bmc& b, Outbox& out);
+    Node* entityNode(Bmc& b, unsigned int entityId, unsigned int entityInstance, Outbox& out);
+    unsigned int claimInstance(Bmc& b, unsigned int parent, IC::Node::SensorType type, unsigned int wanted);
     void judge(Tracked& t, std::string const& state, std::string const& message, Outbox& out);
     Node* newNode(IC::Node::SensorType type, unsigned int instance, unsigned int parent, std::string const& desc);
     void deliver(Outbox& out);
