@@ -18,6 +18,7 @@
 
 #ifndef IC_IPMI_DEFAULT_CONFIG
 #define IC_IPMI_DEFAULT_CONFIG "/etc/instrumentationcontrol/ipmi.conf"
+#define IC_IPMI_CONFIG_FROM_LIBDIR ""
 #endif
 
 namespace ipmi {
@@ -151,7 +152,8 @@ IpmiMI::Node* IpmiMI::newNode(Node::SensorType type, unsigned int instance, unsi
 IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
 {
     char const* env = std::getenv("IC_IPMI_CONFIG");
-    std::string const configPath = env && *env ? env : IC_IPMI_DEFAULT_CONFIG;
+    std::string const configPath =
+        env && *env ? env : SD::PlatformUtilities::getInstalledPath(IC_IPMI_CONFIG_FROM_LIBDIR, IC_IPMI_DEFAULT_CONFIG);
     std::vector<BmcConfig> configs = readConfig(configPath);
     struct stat st {};
     bool const inBand = ::stat("/dev/ipmi0", &st) == 0 && S_ISCHR(st.st_mode);
