@@ -30,16 +30,12 @@ constexpr int kDeadlineMs = 15000; // a sanitizer build on a busy 2-core machine
 unsigned int freePort(int type)
 {
     int const fd = ::socket(AF_INET, type, 0);
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    sockaddr_in a{AF_INET, 0, {htonl(INADDR_LOOPBACK)}, {}};
     socklen_t len = sizeof a;
-    unsigned int port = 0;
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0 &&
-        ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0)
-        port = ntohs(a.sin_port);
+    bool const bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), len) == 0 &&
+                       ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0;
     ::close(fd);
-    return port;
+    return bound ? ntohs(a.sin_port) : 0;
 }
 
 class IpmiTest : public ::testing::Test {
@@ -62,12 +58,7 @@ protected:
                       std::to_string(freePort(SOCK_STREAM))), 0)
             << run("cat " + tmp_.path("sim/ipmi_sim.log"));
     }
-    void TearDown() override
-    {
-        close();
-        if (lan_)
-            sim("stop " + tmp_.path("sim"));
-    }
+    void TearDown() override { close(); if (lan_) sim("stop " + tmp_.path("sim")); }
 
     int sim(std::string const& args) { return std::system((IPMI_EXAMPLES "/bmcsim.sh " + args + " >/dev/null").c_str()); }
     void console(std::string const& command) { ASSERT_EQ(sim("cmd " + tmp_.path("sim") + " '" + command + "'"), 0); }
@@ -92,19 +83,26 @@ protected:
     }
     void close() { if (std::exchange(ic_, nullptr)) Unloadlib(); }
 
+    std::vector<Node*> nodes() const { std::vector<Node*> all; ic_->getAllNodes(all); return all; }
     Node* byName(std::string const& description) const
     {
-        std::vector<Node*> all;
-        ic_->getAllNodes(all);
-        for (Node* n : all)
+        for (Node* n : nodes())
             if (n->getDescription() == description)
                 return n;
         return nullptr;
     }
-    Node* parentOf(std::string const& description) const
+    Node* parentOf(Node const* n) const
     {
         Node* p = nullptr;
-        return byName(description) && ic_->getNode(byName(description)->getLinkedId(), &p).getStatus() == 0 ? p : nullptr;
+        return n && ic_->getNode(n->getLinkedId(), &p).getStatus() == 0 ? p : nullptr;
+    }
+    // The description of the ROOT above a node; "" when a parent is missing.
+    std::string rootOf(std::string const& description) const
+    {
+        Node* n = byName(description);
+        while (n && n->getSensor() != Node::ROOT)
+            n = parentOf(n);
+        return n ? n->getDescription() : "";
     }
     std::string prop(std::string const& description, std::string const& name) const
     {
@@ -153,9 +151,8 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
                               " -u monitor -p icbmc-secret -W opensesspriv -l operator --quiet-cache "
                               "--sdr-cache-directory " + tmp_.path("cache") + " --output-sensor-thresholds "
                               "--comma-separated-output --no-header-output --output-sensor-state"));
-    std::map<std::string, Node::SensorType> const types{
-        {"Temperature", Node::TemperatureSensor}, {"Fan", Node::Fan}, {"Voltage", Node::VoltageSensor},
-        {"Power Supply", Node::PowerSupply}};
+    std::map<std::string, Node::SensorType> const types{{"Temperature", Node::TemperatureSensor}, {"Fan", Node::Fan},
+        {"Voltage", Node::VoltageSensor}, {"Power Supply", Node::PowerSupply}};
     std::map<std::string, std::string> const states{{"Nominal", "ok"}, {"Warning", "warning"}, {"Critical", "critical"}};
     // ID,Name,Type,State,Reading,Units,Lower NR,Lower C,Lower NC,Upper NC,Upper C,Upper NR,Event
     std::pair<int, char const*> const columns[] = {
@@ -166,9 +163,8 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
         for (std::string c; std::getline(cells, c, ',');)
             f.push_back(c);
         ASSERT_GE(f.size(), 12u) << line;
-        Node* n = byName(f[1]);
-        ASSERT_NE(n, nullptr) << f[1];
-        EXPECT_EQ(n->getSensor(), types.at(f[2])) << f[1];
+        ASSERT_NE(byName(f[1]), nullptr) << f[1];
+        EXPECT_EQ(byName(f[1])->getSensor(), types.at(f[2])) << f[1];
         EXPECT_EQ(prop(f[1], "state"), states.at(f[3])) << f[1];
         for (auto const& [col, name] : columns)
             if (f[col] == "N/A")
@@ -185,7 +181,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     std::pair<char const*, char const*> const entities[] = {{"CPU1 Temp", "Processor 1: - - -"}, {"PS2 Status",
         "Power Supply 2: Voltra VP-800 PSU2-0043"}, {"Inlet Temp", "System Board 1: Icebox Systems ICB-2U Board BRD0001234"}};
     for (auto const& [sensor, entity] : entities) {
-        Node* e = parentOf(sensor);
+        Node* e = parentOf(byName(sensor));
         ASSERT_NE(e, nullptr) << sensor;
         std::string const d = e->getDescription();
         EXPECT_EQ(d + ": " + prop(d, "vendor") + " " + prop(d, "model") + " " + prop(d, "serial"), entity);
@@ -249,9 +245,7 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     if (!fs::exists("/dev/ipmi0")) { // else this machine has an in-band BMC
         ictest::EnvGuard none("IC_IPMI_CONFIG", tmp_.path("missing.conf"));
         open();
-        std::vector<Node*> all;
-        ic_->getAllNodes(all);
-        EXPECT_EQ(all.size(), 0u);
+        EXPECT_EQ(nodes().size(), 0u);
         expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") +
                            "; reporting nothing");
         close();
@@ -285,22 +279,27 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
 
     // linuxhw (loaded after ipmi, by file name) adopts the ROOT and Chassis 0.
     std::multiset<std::string> top, roots{"ROOT:00000000", "ROOT:00000000->Chassis:00000000"};
-    std::vector<Node*> all;
-    ic_->getAllNodes(all);
-    for (Node* n : all)
+    for (Node* n : nodes())
         if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
             top.insert(ic_->getNodeHierarchy(n));
     for (std::string const& b : {bmc_, wrongBmc})
-        roots.insert(parentOf(b) ? ic_->getNodeHierarchy(parentOf(b)) : "no chassis above " + b);
+        roots.insert(parentOf(byName(b)) ? ic_->getNodeHierarchy(parentOf(byName(b))) : "no chassis above " + b);
     EXPECT_EQ(top, roots);
     // ipmi removed by a reload: linuxhw announces its nodes again below a
     // ROOT and Chassis of its own, so that none is left without its parent.
     fs::remove(tmp_.path("mi/ipmi.so"));
     IC::InstCtrl::TimedReload();
-    std::string const coreAt = "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000";
-    auto core = [&] { return byName(bmc_) ? nullptr : byName("CPU 0 core 0"); };
-    EXPECT_TRUE(ictest::eventually([&] { return core() && ic_->getNodeHierarchy(core()) == coreAt; }, kDeadlineMs));
-    EXPECT_NE(parentOf("CPU 0 core 0"), nullptr);
+    std::string const ours = "Server with a BMC", core = "CPU 0 core 0";
+    EXPECT_TRUE(ictest::eventually([&] { return !byName(bmc_) && rootOf(core) != "" && rootOf(core) != ours; }, kDeadlineMs));
+    EXPECT_EQ(ic_->getNodeHierarchy(byName(core)), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+    // The mirror image: ipmi, loaded after linuxhw, adopts its ROOT; linuxhw
+    // removed, ipmi announces every node again below a ROOT of its own.
+    fs::create_symlink(IPMI_PLUGIN, tmp_.path("mi/ipmi.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf(bmc_) == rootOf(core) && rootOf(core) != ""; }, kDeadlineMs));
+    fs::remove(tmp_.path("mi/linuxhw.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return !byName(core) && rootOf("Inlet Temp") == ours; }, kDeadlineMs));
 }
 
 } // namespace

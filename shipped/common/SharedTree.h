@@ -21,8 +21,8 @@
 // - Its removal alerts (release included) name only its own nodes.
 // - When the adopted node goes away (the other plug-in removed by a
 //   reload), the adopter removes its nodes and announces them again below a
-//   ROOT and Chassis of its own (linuxhw does; ipmi, which loads first,
-//   does not yet).
+//   ROOT and Chassis of its own. Its polling thread learns it from the record
+//   alone (adoptedTopGone), never from the node.
 #pragma once
 
 #include <IC/ManagementInterface.h>
@@ -49,6 +49,14 @@ IC_SHIPPED_API void announceTop(SharedTop const& reported);
 // Clears the record if rootId is still the recorded ROOT.
 IC_SHIPPED_API void withdrawTop(unsigned int rootId);
 IC_SHIPPED_API SharedTop sharedTop();
+
+// True when the ROOT adopted (adoptedRootId; 0: none adopted) is gone: the
+// plug-in that reported it withdrew it as it was released. Reads only the
+// record, so a polling thread may ask.
+inline bool adoptedTopGone(unsigned int adoptedRootId)
+{
+    return adoptedRootId != 0 && sharedTop().rootId != adoptedRootId;
+}
 
 // The id of the node at path that another plug-in reports, or 0 when there
 // is none, no look-up, or the record says nobody reports it (recorded: the

@@ -182,6 +182,8 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     shipped::SharedTop const top = shipped::sharedTop();
     unsigned int rootId = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath);
     unsigned int chassisId = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath);
+    adoptedRootId_ = rootId;
+    adoptedChassisId_ = chassisId;
     if (rootId == 0) {
         rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
         if (chassisId == 0)
@@ -190,6 +192,7 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     } else if (chassisId == 0) {
         chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
     }
+    chassisId_ = chassisId;
     std::set<unsigned int> chassisInstances{0};
     for (BmcConfig& c : configs) {
         auto b = std::make_unique<Bmc>();
@@ -243,6 +246,17 @@ void IpmiMI::run()
 
 void IpmiMI::pass()
 {
+    {
+        // The adopted ROOT is gone once the plug-in that reported it withdrew
+        // it (it was released); its node is never touched from here.
+        Outbox out;
+        std::unique_lock<std::mutex> g(lock_);
+        if (mapped_ && shipped::adoptedTopGone(adoptedRootId_)) {
+            rehome(out);
+            g.unlock();
+            deliver(out);
+        }
+    }
     // bmcs_ is fixed once the thread runs; each BMC's reader is this thread's.
     for (auto& b : bmcs_) {
         if (std::chrono::steady_clock::now() < b->nextTry)
@@ -359,6 +373,43 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
     }
 }
 
+void IpmiMI::rehome(Outbox& out)
+{
+    // Our nodes hang below a ROOT (and maybe a Chassis) the library no longer
+    // has: take them back and announce them again below our own.
+    std::vector<std::string> paths;
+    for (Node const* n : order_)
+        if (std::string path = n->knownPath(); !path.empty())
+            paths.push_back(std::move(path));
+    std::string const message = "ipmi: the shared chassis went away; reporting a chassis of its own";
+    IPMI_LOG(kWarning, message);
+    if (!paths.empty())
+        out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
+                                  message);
+    std::vector<Node*> const announced = order_;
+    unsigned int const rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
+    unsigned int const chassisId = chassisId_ = adoptedChassisId_ == 0
+                                                    ? chassisId_
+                                                    : newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+    out.arrivals.assign(order_.begin() + static_cast<std::ptrdiff_t>(announced.size()), order_.end());
+    auto const moved = [&](unsigned int id) {
+        return id == adoptedRootId_ ? rootId : id == adoptedChassisId_ && id != 0 ? chassisId : id;
+    };
+    for (Node* n : announced) {
+        n->setLinkedId(moved(n->getLinkedId()));
+        out.arrivals.push_back(n);
+    }
+    for (auto& b : bmcs_) {
+        b->parentId = moved(b->parentId);
+        decltype(b->instances) claims;
+        for (auto const& [parent, type, instance] : b->instances)
+            claims.emplace(moved(parent), type, instance);
+        b->instances.swap(claims);
+    }
+    adoptedRootId_ = adoptedChassisId_ = 0;
+    shipped::announceTop({rootId, chassisId});
+}
+
 unsigned int IpmiMI::claimInstance(Bmc& b, unsigned int parent, Node::SensorType type, unsigned int wanted)
 {
     while (!b.instances.emplace(parent, type, wanted).second)
@@ -401,6 +452,8 @@ void IpmiMI::deliver(Outbox& out)
         arrivalContext = arrivalContext_;
         alertContext = alertContext_;
     }
+    if (alert && !out.removals.empty())
+        alert(out.removals, alertContext);
     for (Node* n : out.arrivals) {
         if (!arrival)
             break;

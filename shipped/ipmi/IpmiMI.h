@@ -75,6 +75,7 @@ private:
     };
 
     struct Outbox {
+        std::vector<IC::Alert> removals; // told first
         std::vector<Node*> arrivals;
         std::vector<IC::Alert> alerts;
     };
@@ -86,6 +87,7 @@ private:
     unsigned int claimInstance(Bmc& b, unsigned int parent, IC::Node::SensorType type, unsigned int wanted);
     void judge(Tracked& t, std::string const& state, std::string const& message, Outbox& out);
     Node* newNode(IC::Node::SensorType type, unsigned int instance, unsigned int parent, std::string const& desc);
+    void rehome(Outbox& out);
     void deliver(Outbox& out);
     void stop();
 
@@ -99,6 +101,10 @@ private:
     bool stopping_ = false;
     unsigned int passes_ = 0;
     unsigned int ownRootId_ = 0; // the shared ROOT when we report it
+    // The ROOT and Chassis another plug-in reports, when adopted (0: ours).
+    unsigned int adoptedRootId_ = 0;
+    unsigned int adoptedChassisId_ = 0;
+    unsigned int chassisId_ = 0; // Chassis 0, adopted or ours
     std::vector<Node*> order_; // nodes in the order made: parents first
     std::vector<std::unique_ptr<Node>> nodes_;
     std::vector<std::unique_ptr<Bmc>> bmcs_;

@@ -234,7 +234,7 @@ void LinuxHwMI::poll()
     {
         SD::MutexGuard g(lock_);
         auto const root = adopted_.find(kRootKey);
-        orphaned = root != adopted_.end() && shipped::sharedTop().rootId != root->second;
+        orphaned = root != adopted_.end() && shipped::adoptedTopGone(root->second);
     }
     DeviceList fixed;
     if (orphaned) {
