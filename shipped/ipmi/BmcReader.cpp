@@ -120,6 +120,18 @@ void addFruLocator(ipmi_sdr_ctx_t sdr, uint8_t recordType, std::vector<Locator>&
         out.push_back({0, eid, einst});
 }
 
+// What tells one SDR cache file from another: name, inode, time and size;
+// "" when there is none.
+std::string cacheStamp(std::string const& dir)
+{
+    std::string const file = cacheFileIn(dir);
+    struct stat st {};
+    if (file.empty() || ::stat(file.c_str(), &st) != 0)
+        return std::string();
+    return file + " " + std::to_string(st.st_ino) + " " + std::to_string(st.st_mtim.tv_sec) + "." +
+           std::to_string(st.st_mtim.tv_nsec) + " " + std::to_string(st.st_size);
+}
+
 } // namespace
 
 BmcReader::BmcReader(BmcConfig config, std::string cacheDir)
@@ -231,10 +243,18 @@ bool BmcReader::read(std::vector<Sensor>& out, std::string& error)
     }
     ipmi_monitoring_ipmi_config cfg = ipmiConfig();
     unsigned int const flags = IPMI_MONITORING_SENSOR_READING_FLAGS_DISCRETE_READING;
+    std::string const before = cacheStamp(cacheDir_);
     int const n = ipmi_monitoring_sensor_readings_by_record_id(ctx_, hostname(), &cfg, flags, nullptr, 0, nullptr, nullptr);
     if (n < 0) {
         error = ipmi_monitoring_ctx_errormsg(ctx_);
         return false;
+    }
+    // libipmimonitoring downloads the SDR only when the cache is missing or
+    // older than the BMC's repository.
+    if (std::string const after = cacheStamp(cacheDir_); after != before) {
+        ++sdrDownloads_;
+        IPMI_LOG(kDebug, "SDR of ", config_.name.empty() ? "the in-band BMC" : host_, " downloaded (",
+                 sdrDownloads_, " since start): ", after);
     }
     loadSdrFacts();
     out.clear();

@@ -81,6 +81,9 @@ public:
     std::vector<Inventory> const& inventory() const { return inventory_; }
 
     BmcConfig const& config() const { return config_; }
+    // How many times read() found the SDR downloaded anew (logged at debug
+    // level): once on a cold cache, then only when the BMC's SDR changed.
+    unsigned int sdrDownloads() const { return sdrDownloads_; }
 
 private:
     struct SdrFacts {
@@ -112,6 +115,7 @@ private:
     std::string firmware_;
     std::string ipmiVersion_;
     std::vector<Inventory> inventory_;
+    unsigned int sdrDownloads_ = 0;
 };
 
 } // namespace ipmi

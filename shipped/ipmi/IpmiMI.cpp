@@ -213,9 +213,12 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         b->reader = std::make_unique<BmcReader>(std::move(c), dir);
         bmcs_.push_back(std::move(b));
     }
-    thread_ = std::thread([this] { run(); });
+    // One thread per BMC: each has its own session, and one that does not
+    // answer holds up only its own readings.
+    for (auto& b : bmcs_)
+        b->thread = std::thread([this, bmc = b.get()] { run(*bmc); });
     // Open waits for one pass, but not for a BMC that does not answer.
-    if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return passes_ > 0; }))
+    if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return firstPasses_ == bmcs_.size(); }))
         IPMI_LOG(kWarning, "the BMCs did not all answer within ", kOpenWaitMs,
                  " ms; their sensors are reported when they do");
     IPMI_LOG(kProgress, "reporting ", order_.size(), " nodes from ", bmcs_.size(), " BMCs, polling every ",
@@ -231,42 +234,30 @@ IC::Error IpmiMI::getMap(std::vector<IC::Node*>& nodes)
     return ok();
 }
 
-void IpmiMI::run()
+void IpmiMI::run(Bmc& b)
 {
+    // bmcs_ is fixed once the threads run; b's reader is this thread's.
     std::unique_lock<std::mutex> g(lock_);
-    while (!stopping_) {
-        g.unlock();
-        pass();
-        g.lock();
-        ++passes_;
-        wake_.notify_all();
-        wake_.wait_for(g, std::chrono::milliseconds(pollMs_), [this] { return stopping_; });
-    }
-}
-
-void IpmiMI::pass()
-{
-    {
-        // The adopted ROOT is gone once the plug-in that reported it withdrew
-        // it (it was released); its node is never touched from here.
-        Outbox out;
-        std::unique_lock<std::mutex> g(lock_);
-        if (mapped_ && shipped::adoptedTopGone(adoptedRootId_)) {
-            rehome(out);
+    for (bool first = true; !stopping_; first = false) {
+        if (std::chrono::steady_clock::now() >= b.nextTry) {
+            Outbox out;
+            // The adopted ROOT is gone once the plug-in that reported it
+            // withdrew it (it was released); its node is never touched from
+            // here. Whichever thread sees it first moves every BMC's nodes.
+            if (mapped_ && shipped::adoptedTopGone(adoptedRootId_))
+                rehome(out);
             g.unlock();
             deliver(out);
+            out = Outbox();
+            readBmc(b, out);
+            deliver(out);
+            g.lock();
         }
-    }
-    // bmcs_ is fixed once the thread runs; each BMC's reader is this thread's.
-    for (auto& b : bmcs_) {
-        if (std::chrono::steady_clock::now() < b->nextTry)
-            continue;
-        Outbox out;
-        readBmc(*b, out);
-        deliver(out);
-        std::lock_guard<std::mutex> g(lock_);
-        if (stopping_)
-            return;
+        if (first) {
+            ++firstPasses_;
+            wake_.notify_all();
+        }
+        wake_.wait_for(g, std::chrono::milliseconds(pollMs_), [this] { return stopping_; });
     }
 }
 
@@ -473,8 +464,9 @@ void IpmiMI::stop()
         stopping_ = true;
     }
     wake_.notify_all();
-    if (thread_.joinable())
-        thread_.join();
+    for (auto& b : bmcs_)
+        if (b->thread.joinable())
+            b->thread.join();
 }
 
 IC::Error IpmiMI::shutdown()

@@ -3,9 +3,10 @@
 // the out-of-band BMCs of IC_IPMI_CONFIG (IPMI LAN 2.0). See README.md
 // beside this file for the tree, the sensor-type mapping and the alerts.
 //
-// Threads: one reading thread polls every BMC in turn every
-// IC_IPMI_POLL_MS (default 10000) milliseconds. It starts in Initialize,
-// which waits at most kOpenWaitMs for its first pass, so a BMC that does not
+// Threads: one reading thread per BMC polls it every IC_IPMI_POLL_MS
+// (default 10000) milliseconds, so that BMCs are read in parallel and one
+// that does not answer holds up no other. They start in Initialize, which
+// waits at most kOpenWaitMs for their first passes, so a BMC that does not
 // answer delays Open by at most that long; what is read later arrives
 // through the library's arrival callback. The plug-in's state is kept under
 // a mutex that is never held while calling the library.
@@ -72,6 +73,7 @@ private:
         bool reachable = true;
         unsigned int failures = 0;
         std::chrono::steady_clock::time_point nextTry{};
+        std::thread thread; // polls this BMC alone
     };
 
     struct Outbox {
@@ -80,8 +82,7 @@ private:
         std::vector<IC::Alert> alerts;
     };
 
-    void run();
-    void pass();
+    void run(Bmc& b);
     void readBmc(Bmc& b, Outbox& out);
     Node* entityNode(Bmc& b, unsigned int entityId, unsigned int entityInstance, Outbox& out);
     unsigned int claimInstance(Bmc& b, unsigned int parent, IC::Node::SensorType type, unsigned int wanted);
@@ -99,7 +100,7 @@ private:
     bool initialized_ = false;
     bool mapped_ = false;  // getMap has handed the nodes over: later ones are arrivals
     bool stopping_ = false;
-    unsigned int passes_ = 0;
+    std::size_t firstPasses_ = 0; // BMCs through their first pass
     unsigned int ownRootId_ = 0; // the shared ROOT when we report it
     // The ROOT and Chassis another plug-in reports, when adopted (0: ours).
     unsigned int adoptedRootId_ = 0;
@@ -113,7 +114,6 @@ private:
     IC::NodeArrivalCallBack arrivalCB_ = nullptr;
     void const* arrivalContext_ = nullptr;
     IC::NodeLookupCallBack lookup_ = nullptr;
-    std::thread thread_;
 };
 
 } // namespace ipmi
