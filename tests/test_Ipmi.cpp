@@ -15,6 +15,7 @@
 #include <unistd.h>
 
 #include <map>
+#include <regex>
 #include <utility>
 
 namespace {
@@ -157,11 +158,9 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     // ID,Name,Type,State,Reading,Units,Lower NR,Lower C,Lower NC,Upper NC,Upper C,Upper NR,Event
     std::pair<int, char const*> const columns[] = {
         {4, "reading"}, {7, "lower_critical"}, {8, "lower_warning"}, {9, "upper_warning"}, {10, "upper_critical"}};
+    std::regex const comma(",");
     for (std::string const& line : table) {
-        std::vector<std::string> f;
-        std::istringstream cells(line);
-        for (std::string c; std::getline(cells, c, ',');)
-            f.push_back(c);
+        std::vector<std::string> const f(std::sregex_token_iterator(line.begin(), line.end(), comma, -1), {});
         ASSERT_GE(f.size(), 12u) << line;
         ASSERT_NE(byName(f[1]), nullptr) << f[1];
         EXPECT_EQ(byName(f[1])->getSensor(), types.at(f[2])) << f[1];
@@ -174,9 +173,8 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
         EXPECT_EQ(prop(f[1], "condition_class"), f[3] == "Nominal" ? "-" : "5") << f[1];
     }
     EXPECT_EQ(table.size(), 8u);
-    Node* bmc = byName(bmc_);
-    ASSERT_NE(bmc, nullptr);
-    EXPECT_EQ(ic_->getNodeHierarchy(bmc).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(bmc);
+    ASSERT_NE(byName(bmc_), nullptr);
+    EXPECT_EQ(ic_->getNodeHierarchy(byName(bmc_)).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(byName(bmc_));
     // Sensors below their entity's node, which has the entity's FRU inventory.
     std::pair<char const*, char const*> const entities[] = {{"CPU1 Temp", "Processor 1: - - -"}, {"PS2 Status",
         "Power Supply 2: Voltra VP-800 PSU2-0043"}, {"Inlet Temp", "System Board 1: Icebox Systems ICB-2U Board BRD0001234"}};
@@ -185,7 +183,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
         ASSERT_NE(e, nullptr) << sensor;
         std::string const d = e->getDescription();
         EXPECT_EQ(d + ": " + prop(d, "vendor") + " " + prop(d, "model") + " " + prop(d, "serial"), entity);
-        EXPECT_EQ(e->getLinkedId(), bmc->getLinkedId()) << sensor;
+        EXPECT_EQ(e->getLinkedId(), byName(bmc_)->getLinkedId()) << sensor;
     }
     std::string const ps2 = byName("PS2 Status")->getPath();
     EXPECT_EQ(prop(bmc_, "version") + " " + prop(bmc_, "ipmi_version"), "9.08 2.0"); // as bmc-info says
@@ -201,8 +199,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     std::map<std::string, std::size_t> seen;
     for (auto const& [command, sensor] : steps) {
         console(command);
-        ++seen[sensor];
-        expectAlerts(sensor, std::vector<std::string>(expected[sensor].begin(), expected[sensor].begin() + seen[sensor]));
+        expectAlerts(sensor, std::vector<std::string>(expected[sensor].begin(), expected[sensor].begin() + ++seen[sensor]));
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(600)); // three more polls
     for (auto const& [sensor, list] : expected)
@@ -240,18 +237,15 @@ TEST_F(IpmiTest, StoppedBmcIsUnknownAndComesBack)
 // with linuxhw there is one tree.
 TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
 {
-    std::string const conf = tmp_.path("ipmi.conf");
     std::vector<std::string> expected;
     if (!fs::exists("/dev/ipmi0")) { // else this machine has an in-band BMC
         ictest::EnvGuard none("IC_IPMI_CONFIG", tmp_.path("missing.conf"));
         open();
         EXPECT_EQ(nodes().size(), 0u);
-        expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") +
-                           "; reporting nothing");
-        close();
+        expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") + "; reporting nothing");
     }
     std::string const pw644 = secret("pw644", "icbmc-secret", 0644), wrong = secret("wrong", "nope", 0600);
-    std::string const host = "host = 127.0.0.1:" + std::to_string(lan_) + "\n", e = std::to_string(HGLog::HGLogger::LEVEL_ERROR) + " " + conf;
+    std::string const host = "host = 127.0.0.1:" + std::to_string(lan_) + "\n", e = std::to_string(HGLog::HGLogger::LEVEL_ERROR) + " " + tmp_.path("ipmi.conf");
     tmp_.write("ipmi.conf", "[bmc a]\nhost = 127.0.0.1:70000\n"
                             "[bmc b]\n" + host + "colour = blue\n"
                             "[bmc c]\n" + host + "password_file = /nonexistent/pw\n"
@@ -285,11 +279,15 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     for (std::string const& b : {bmc_, wrongBmc})
         roots.insert(parentOf(byName(b)) ? ic_->getNodeHierarchy(parentOf(byName(b))) : "no chassis above " + b);
     EXPECT_EQ(top, roots);
+    // ipmi replaced in one reload: linuxhw joins the ROOT the new one reports.
+    std::string const ours = "Server with a BMC", core = "CPU 0 core 0";
+    fs::rename(tmp_.path("mi/ipmi.so"), tmp_.path("mi/ipmi2.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf(core) == ours && rootOf(bmc_) == ours; }, kDeadlineMs));
     // ipmi removed by a reload: linuxhw announces its nodes again below a
     // ROOT and Chassis of its own, so that none is left without its parent.
-    fs::remove(tmp_.path("mi/ipmi.so"));
+    fs::remove(tmp_.path("mi/ipmi2.so"));
     IC::InstCtrl::TimedReload();
-    std::string const ours = "Server with a BMC", core = "CPU 0 core 0";
     EXPECT_TRUE(ictest::eventually([&] { return !byName(bmc_) && rootOf(core) != "" && rootOf(core) != ours; }, kDeadlineMs));
     EXPECT_EQ(ic_->getNodeHierarchy(byName(core)), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
     // The mirror image: ipmi, loaded after linuxhw, adopts its ROOT; linuxhw
@@ -297,7 +295,11 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
     fs::create_symlink(IPMI_PLUGIN, tmp_.path("mi/ipmi.so"));
     IC::InstCtrl::TimedReload();
     EXPECT_TRUE(ictest::eventually([&] { return rootOf(bmc_) == rootOf(core) && rootOf(core) != ""; }, kDeadlineMs));
-    fs::remove(tmp_.path("mi/linuxhw.so"));
+    // linuxhw replaced in one reload: ipmi joins the ROOT the new one reports.
+    fs::rename(tmp_.path("mi/linuxhw.so"), tmp_.path("mi/linuxhw2.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf("Inlet Temp") == rootOf(core) && rootOf(core) != ""; }, kDeadlineMs));
+    fs::remove(tmp_.path("mi/linuxhw2.so"));
     IC::InstCtrl::TimedReload();
     EXPECT_TRUE(ictest::eventually([&] { return !byName(core) && rootOf("Inlet Temp") == ours; }, kDeadlineMs));
 }

@@ -21,8 +21,10 @@
 // - Its removal alerts (release included) name only its own nodes.
 // - When the adopted node goes away (the other plug-in removed by a
 //   reload), the adopter removes its nodes and announces them again below a
-//   ROOT and Chassis of its own. Its polling thread learns it from the record
-//   alone (adoptedTopGone), never from the node.
+//   ROOT and Chassis of its own, or, when the record names them already (a
+//   plug-in loaded in the same reload, the other one replaced), below those,
+//   adopted by the record's ids. Its polling thread learns all of it from the
+//   record alone (adoptedTopGone, sharedTop), never from the nodes.
 #pragma once
 
 #include <IC/ManagementInterface.h>
@@ -56,6 +58,14 @@ IC_SHIPPED_API SharedTop sharedTop();
 inline bool adoptedTopGone(unsigned int adoptedRootId)
 {
     return adoptedRootId != 0 && sharedTop().rootId != adoptedRootId;
+}
+
+// What a plug-in says (its log line and removal alert) as it takes its
+// nodes back after adoptedTopGone: now is the record as it then reads it.
+inline std::string rehomeMessage(std::string const& plugin, SharedTop const& now)
+{
+    return plugin + (now.rootId != 0 ? ": the shared chassis went away; joining the one reported now"
+                                     : ": the shared chassis went away; reporting a chassis of its own");
 }
 
 // The id of the node at path that another plug-in reports, or 0 when there

@@ -367,21 +367,27 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
 void IpmiMI::rehome(Outbox& out)
 {
     // Our nodes hang below a ROOT (and maybe a Chassis) the library no longer
-    // has: take them back and announce them again below our own.
+    // has: take them back and announce them again below our own, or below
+    // those a plug-in loaded in the same reload reports already (adopted by
+    // the ids of the record alone: their nodes are not touched from here).
+    shipped::SharedTop const now = shipped::sharedTop();
+    bool const ownChassis = adoptedChassisId_ == 0; // ours stays, relinked
     std::vector<std::string> paths;
     for (Node const* n : order_)
         if (std::string path = n->knownPath(); !path.empty())
             paths.push_back(std::move(path));
-    std::string const message = "ipmi: the shared chassis went away; reporting a chassis of its own";
+    std::string const message = shipped::rehomeMessage("ipmi", now);
     IPMI_LOG(kWarning, message);
     if (!paths.empty())
         out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
                                   message);
     std::vector<Node*> const announced = order_;
-    unsigned int const rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
-    unsigned int const chassisId = chassisId_ = adoptedChassisId_ == 0
-                                                    ? chassisId_
-                                                    : newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+    if (now.rootId == 0)
+        ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
+    unsigned int const rootId = now.rootId != 0 ? now.rootId : ownRootId_;
+    unsigned int const chassisId = ownChassis                          ? chassisId_
+                                   : now.rootId != 0 && now.chassisId != 0 ? now.chassisId
+                                       : newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
     out.arrivals.assign(order_.begin() + static_cast<std::ptrdiff_t>(announced.size()), order_.end());
     auto const moved = [&](unsigned int id) {
         return id == adoptedRootId_ ? rootId : id == adoptedChassisId_ && id != 0 ? chassisId : id;
@@ -397,8 +403,11 @@ void IpmiMI::rehome(Outbox& out)
             claims.emplace(moved(parent), type, instance);
         b->instances.swap(claims);
     }
-    adoptedRootId_ = adoptedChassisId_ = 0;
-    shipped::announceTop({rootId, chassisId});
+    adoptedRootId_ = now.rootId;
+    adoptedChassisId_ = chassisId == now.chassisId && !ownChassis ? chassisId : 0;
+    chassisId_ = chassisId;
+    if (now.rootId == 0)
+        shipped::announceTop({rootId, chassisId});
 }
 
 unsigned int IpmiMI::claimInstance(Bmc& b, unsigned int parent, Node::SensorType type, unsigned int wanted)
