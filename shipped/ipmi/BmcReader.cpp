@@ -346,7 +346,9 @@ bool fields(ipmi_ctx_t ctx, fiid_template_t tmpl, Command command,
 
 namespace {
 
-// The text of a FRU field; "" when it is empty or cannot be read.
+// The text of a FRU field, without the padding FRUs often carry and with
+// control characters (a BMC's data is not trusted) shown as '?'; "" when it
+// is empty or cannot be read.
 std::string fruText(ipmi_fru_ctx_t fru, ipmi_fru_field_t const& field, uint8_t language)
 {
     char text[IPMI_FRU_AREA_STRING_MAX + 1] = {};
@@ -355,7 +357,13 @@ std::string fruText(ipmi_fru_ctx_t fru, ipmi_fru_field_t const& field, uint8_t l
         ipmi_fru_type_length_field_to_string(fru, field.type_length_field, field.type_length_field_length, language,
                                              text, &length) < 0)
         return std::string();
-    return std::string(text, std::min<unsigned int>(length, IPMI_FRU_AREA_STRING_MAX));
+    std::string out(text, std::min<unsigned int>(length, IPMI_FRU_AREA_STRING_MAX));
+    for (char& c : out)
+        if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f)
+            c = '?';
+    // Padding: spaces, or NULs (now '?') after the text.
+    std::size_t const first = out.find_first_not_of(' '), last = out.find_last_not_of(" ?");
+    return last == std::string::npos ? std::string() : out.substr(first, last + 1 - first);
 }
 
 } // namespace
