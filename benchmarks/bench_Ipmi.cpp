@@ -19,8 +19,12 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <atomic>
 #include <map>
+#include <memory>
 #include <string>
+#include <thread>
+#include <vector>
 
 namespace {
 
@@ -30,12 +34,12 @@ std::string const kState = "/tmp/ic_bench_ipmi";
 unsigned int const kLan = 20000 + static_cast<unsigned int>(::getpid() % 1000) * 20;
 constexpr int kSimulators = 8;
 
-ipmi::BmcConfig config()
+ipmi::BmcConfig config(int simulator = 0)
 {
     ipmi::BmcConfig c;
     c.name = "bench";
     c.host = "127.0.0.1";
-    c.port = kLan;
+    c.port = kLan + 2 * simulator;
     c.user = "monitor";
     c.password = "icbmc-secret";
     c.workarounds = IPMI_MONITORING_WORKAROUND_FLAGS_PROTOCOL_VERSION_2_0_OPEN_SESSION_PRIVILEGE;
@@ -109,6 +113,35 @@ void BM_IpmiSensorsProcess(benchmark::State& state)
             state.SkipWithError("ipmi-sensors failed");
 }
 
+// One poll (sensors and the SEL check) of N simulated BMCs as the plug-in
+// makes it, steady state: a thread per BMC, each with its own reader.
+void BM_PollBmcsInParallel(benchmark::State& state)
+{
+    int const n = static_cast<int>(state.range(0));
+    std::vector<std::unique_ptr<ipmi::BmcReader>> readers;
+    for (int k = 0; k < n; ++k)
+        readers.push_back(std::make_unique<ipmi::BmcReader>(config(k), kState + "/parallel" + std::to_string(k)));
+    std::atomic<int> failed{0};
+    auto const poll = [&](ipmi::BmcReader& r) {
+        std::vector<ipmi::Sensor> sensors;
+        std::vector<ipmi::SelEvent> events;
+        std::string error;
+        if (!r.read(sensors, error) || !r.newEvents(events, error))
+            ++failed;
+    };
+    for (auto& r : readers)
+        poll(*r); // warms the SDR caches, one BMC at a time
+    for (auto _ : state) {
+        std::vector<std::thread> threads;
+        for (auto& r : readers)
+            threads.emplace_back(poll, std::ref(*r));
+        for (auto& t : threads)
+            t.join();
+    }
+    if (failed != 0)
+        state.SkipWithError("a BMC did not answer");
+}
+
 // Every SDR cache file below dir with what tells a rewritten one.
 std::map<std::string, std::string> sdrCaches(std::string const& dir)
 {
@@ -168,6 +201,7 @@ BENCHMARK(BM_PluginPoll)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_PluginPollWithSelCheck)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_MinimalLibipmimonitoringLoop)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_IpmiSensorsProcess)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_PollBmcsInParallel)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
 BENCHMARK(BM_PluginOpenWithBmcs)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 } // namespace
