@@ -15,6 +15,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <cstdlib>
+#include <system_error>
 
 #ifndef IC_IPMI_DEFAULT_CONFIG
 #define IC_IPMI_DEFAULT_CONFIG "/etc/instrumentationcontrol/ipmi.conf"
@@ -215,8 +216,14 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     }
     // One thread per BMC: each has its own session, and one that does not
     // answer holds up only its own readings.
-    for (auto& b : bmcs_)
-        b->thread = std::thread([this, bmc = b.get()] { run(*bmc); });
+    for (auto& b : bmcs_) {
+        try {
+            b->thread = std::thread([this, bmc = b.get()] { run(*bmc); });
+        } catch (std::system_error const& e) {
+            ++firstPasses_; // nothing to wait for
+            IPMI_LOG(kError, "no thread to read ", b->label, " (", e.what(), "); it is not read");
+        }
+    }
     // Open waits for one pass, but not for a BMC that does not answer.
     if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return firstPasses_ == bmcs_.size(); }))
         IPMI_LOG(kWarning, "the BMCs did not all answer within ", kOpenWaitMs,
@@ -239,20 +246,21 @@ void IpmiMI::run(Bmc& b)
     // bmcs_ is fixed once the threads run; b's reader is this thread's.
     std::unique_lock<std::mutex> g(lock_);
     for (bool first = true; !stopping_; first = false) {
-        if (std::chrono::steady_clock::now() >= b.nextTry) {
+        Outbox moved;
+        // The adopted ROOT is gone once the plug-in that reported it withdrew
+        // it (it was released); its node is never touched from here.
+        // Whichever thread sees it first moves every BMC's nodes.
+        if (mapped_ && shipped::adoptedTopGone(adoptedRootId_))
+            rehome(moved);
+        bool const due = std::chrono::steady_clock::now() >= b.nextTry;
+        g.unlock();
+        deliver(moved);
+        if (due) {
             Outbox out;
-            // The adopted ROOT is gone once the plug-in that reported it
-            // withdrew it (it was released); its node is never touched from
-            // here. Whichever thread sees it first moves every BMC's nodes.
-            if (mapped_ && shipped::adoptedTopGone(adoptedRootId_))
-                rehome(out);
-            g.unlock();
-            deliver(out);
-            out = Outbox();
             readBmc(b, out);
             deliver(out);
-            g.lock();
         }
+        g.lock();
         if (first) {
             ++firstPasses_;
             wake_.notify_all();
