@@ -1,28 +1,45 @@
 // One poll of the simulated BMC (examples/bmc) as the ipmi plug-in reads it
 // (session set-up included, every sensor, warm SDR cache), against the floor
 // (a minimal libipmimonitoring loop doing the same read) and against
-// FreeIPMI's ipmi-sensors run as a process. Needs ipmi_sim (openipmi).
+// FreeIPMI's ipmi-sensors run as a process. Then the plug-in itself, loaded
+// by the library, reading 1 and 8 out-of-band BMCs (8 simulators: one
+// cannot serve parallel cold SDR downloads): Open waits for every BMC's
+// first poll, so its time is that of one poll of them all; a start with a
+// cached SDR must download none. Needs ipmi_sim (openipmi).
 #include "BmcReader.h"
 
+#include <IC/InstrumentationControl.h>
+
 #include <benchmark/benchmark.h>
+
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <atomic>
+#include <map>
+#include <memory>
 #include <string>
+#include <thread>
+#include <vector>
 
 namespace {
 
 std::string const kState = "/tmp/ic_bench_ipmi";
-constexpr unsigned int kLan = 17623; // loopback only
+// Loopback only; simulator k: LAN kLan + 2k, console + 1. Each run takes its
+// own range: the ports of a run just ended may still be in TIME_WAIT.
+unsigned int const kLan = 20000 + static_cast<unsigned int>(::getpid() % 1000) * 20;
+constexpr int kSimulators = 8;
 
-ipmi::BmcConfig config()
+ipmi::BmcConfig config(int simulator = 0)
 {
     ipmi::BmcConfig c;
     c.name = "bench";
     c.host = "127.0.0.1";
-    c.port = kLan;
+    c.port = kLan + 2 * simulator;
     c.user = "monitor";
     c.password = "icbmc-secret";
     c.workarounds = IPMI_MONITORING_WORKAROUND_FLAGS_PROTOCOL_VERSION_2_0_OPEN_SESSION_PRIVILEGE;
@@ -96,10 +113,96 @@ void BM_IpmiSensorsProcess(benchmark::State& state)
             state.SkipWithError("ipmi-sensors failed");
 }
 
+// One poll (sensors and the SEL check) of N simulated BMCs as the plug-in
+// makes it, steady state: a thread per BMC, each with its own reader.
+void BM_PollBmcsInParallel(benchmark::State& state)
+{
+    int const n = static_cast<int>(state.range(0));
+    std::vector<std::unique_ptr<ipmi::BmcReader>> readers;
+    for (int k = 0; k < n; ++k)
+        readers.push_back(std::make_unique<ipmi::BmcReader>(config(k), kState + "/parallel" + std::to_string(k)));
+    std::atomic<int> failed{0};
+    auto const poll = [&](ipmi::BmcReader& r) {
+        std::vector<ipmi::Sensor> sensors;
+        std::vector<ipmi::SelEvent> events;
+        std::string error;
+        if (!r.read(sensors, error) || !r.newEvents(events, error))
+            ++failed;
+    };
+    for (auto& r : readers)
+        poll(*r); // warms the SDR caches, one BMC at a time
+    for (auto _ : state) {
+        std::vector<std::thread> threads;
+        for (auto& r : readers)
+            threads.emplace_back(poll, std::ref(*r));
+        for (auto& t : threads)
+            t.join();
+    }
+    if (failed != 0)
+        state.SkipWithError("a BMC did not answer");
+}
+
+// Every SDR cache file below dir with what tells a rewritten one.
+std::map<std::string, std::string> sdrCaches(std::string const& dir)
+{
+    std::map<std::string, std::string> out;
+    for (auto const& e : std::filesystem::recursive_directory_iterator(dir)) {
+        struct stat st {};
+        if (e.path().filename().string().rfind("sdr-cache", 0) == 0 && ::stat(e.path().c_str(), &st) == 0)
+            out[e.path()] = std::to_string(st.st_ino) + " " + std::to_string(st.st_mtim.tv_sec) + "." +
+                            std::to_string(st.st_mtim.tv_nsec) + " " + std::to_string(st.st_size);
+    }
+    return out;
+}
+
+// Open with the plug-in reading N simulated BMCs, warm SDR caches, then
+// Unloadlib.
+void BM_PluginOpenWithBmcs(benchmark::State& state)
+{
+    int const n = static_cast<int>(state.range(0));
+    std::string const dir = kState + "/open" + std::to_string(n);
+    for (char const* sub : {"/mi", "/fp", "/data"})
+        std::filesystem::create_directories(dir + sub);
+    std::error_code exists; // from the run that sized the batch
+    std::filesystem::create_symlink(IPMI_PLUGIN, dir + "/mi/ipmi.so", exists);
+    std::ofstream(dir + "/pw") << "icbmc-secret\n";
+    ::chmod((dir + "/pw").c_str(), 0600);
+    std::ofstream conf(dir + "/ipmi.conf");
+    for (int k = 0; k < n; ++k)
+        conf << "[bmc sim" << k << "]\nhost = 127.0.0.1:" << kLan + 2 * k << "\nuser = monitor\npassword_file = " << dir
+             << "/pw\nworkarounds = opensesspriv\n";
+    conf.close();
+    for (auto const& [name, value] : {std::pair{"IC_MI_DIR", "/mi"}, {"IC_FP_DIR", "/fp"}, {"IC_DATA_DIR", "/data"},
+                                      {"IC_IPMI_CONFIG", "/ipmi.conf"}})
+        ::setenv(name, (dir + value).c_str(), 1);
+    ::setenv("IC_IPMI_POLL_MS", "3600000", 1); // one poll per Open
+    IC::InstrumentationControl* ic = nullptr;
+    IC::Error* err = nullptr;
+    auto const cycle = [&] {
+        if (Open(&ic, &err) != 0)
+            state.SkipWithError("Open failed");
+        Unloadlib();
+    };
+    cycle(); // downloads every SDR once
+    auto const warm = sdrCaches(dir + "/data");
+    if (warm.size() != static_cast<std::size_t>(n))
+        state.SkipWithError("not every BMC's SDR was cached");
+    for (auto _ : state)
+        cycle();
+    std::size_t downloads = 0;
+    for (auto const& [file, stamp] : sdrCaches(dir + "/data"))
+        downloads += warm.count(file) == 0 || warm.at(file) != stamp;
+    state.counters["sdr_downloads"] = static_cast<double>(downloads);
+    if (downloads != 0)
+        state.SkipWithError("a start with a cached SDR downloaded it again");
+}
+
 BENCHMARK(BM_PluginPoll)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_PluginPollWithSelCheck)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_MinimalLibipmimonitoringLoop)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_IpmiSensorsProcess)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_PollBmcsInParallel)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
+BENCHMARK(BM_PluginOpenWithBmcs)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 } // namespace
 
@@ -112,13 +215,21 @@ int main(int argc, char** argv)
     int err = 0;
     ipmi_monitoring_init(0, &err);
     std::filesystem::remove_all(kState);
-    std::filesystem::create_directories(kState + "/sim");
     std::string const sim = std::string(BMC_EXAMPLES) + "/bmcsim.sh ";
-    if (std::system((sim + "start " + kState + "/sim " + std::to_string(kLan) + " " + std::to_string(kLan + 1)).c_str()) != 0)
-        return 1;
-    benchmark::Initialize(&argc, argv);
-    benchmark::RunSpecifiedBenchmarks();
-    benchmark::Shutdown();
-    std::system((sim + "stop " + kState + "/sim").c_str());
-    return 0;
+    int started = 0;
+    for (; started < kSimulators; ++started) {
+        std::string const state = kState + "/sim" + (started ? std::to_string(started) : "");
+        std::filesystem::create_directories(state);
+        unsigned int const lan = kLan + 2 * started;
+        if (std::system((sim + "start " + state + " " + std::to_string(lan) + " " + std::to_string(lan + 1)).c_str()) != 0)
+            break;
+    }
+    if (started == kSimulators) {
+        benchmark::Initialize(&argc, argv);
+        benchmark::RunSpecifiedBenchmarks();
+        benchmark::Shutdown();
+    }
+    for (int k = 0; k < started; ++k)
+        std::system((sim + "stop " + kState + "/sim" + (k ? std::to_string(k) : "")).c_str());
+    return started == kSimulators ? 0 : 1;
 }

@@ -14,7 +14,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <map>
+#include <utility>
 
 namespace {
 
@@ -29,16 +31,12 @@ constexpr int kDeadlineMs = 15000; // a sanitizer build on a busy 2-core machine
 unsigned int freePort(int type)
 {
     int const fd = ::socket(AF_INET, type, 0);
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    sockaddr_in a{AF_INET, 0, {htonl(INADDR_LOOPBACK)}, {}};
     socklen_t len = sizeof a;
-    unsigned int port = 0;
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof a) == 0 &&
-        ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0)
-        port = ntohs(a.sin_port);
+    bool const bound = ::bind(fd, reinterpret_cast<sockaddr*>(&a), len) == 0 &&
+                       ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0;
     ::close(fd);
-    return port;
+    return bound ? ntohs(a.sin_port) : 0;
 }
 
 class IpmiTest : public ::testing::Test {
@@ -61,12 +59,7 @@ protected:
                       std::to_string(freePort(SOCK_STREAM))), 0)
             << run("cat " + tmp_.path("sim/ipmi_sim.log"));
     }
-    void TearDown() override
-    {
-        close();
-        if (lan_)
-            sim("stop " + tmp_.path("sim"));
-    }
+    void TearDown() override { close(); if (lan_) sim("stop " + tmp_.path("sim")); }
 
     int sim(std::string const& args) { return std::system((IPMI_EXAMPLES "/bmcsim.sh " + args + " >/dev/null").c_str()); }
     void console(std::string const& command) { ASSERT_EQ(sim("cmd " + tmp_.path("sim") + " '" + command + "'"), 0); }
@@ -89,21 +82,28 @@ protected:
             ASSERT_EQ(IC::InstCtrl::regFPsensorAlerts(ictest::recAlert, static_cast<Node::SensorType>(t), this)
                           .getStatus(), 0);
     }
-    void close()
-    {
-        if (ic_)
-            Unloadlib();
-        ic_ = nullptr;
-    }
+    void close() { if (std::exchange(ic_, nullptr)) Unloadlib(); }
 
+    std::vector<Node*> nodes() const { std::vector<Node*> all; ic_->getAllNodes(all); return all; }
     Node* byName(std::string const& description) const
     {
-        std::vector<Node*> all;
-        ic_->getAllNodes(all);
-        for (Node* n : all)
+        for (Node* n : nodes())
             if (n->getDescription() == description)
                 return n;
         return nullptr;
+    }
+    Node* parentOf(Node const* n) const
+    {
+        Node* p = nullptr;
+        return n && ic_->getNode(n->getLinkedId(), &p).getStatus() == 0 ? p : nullptr;
+    }
+    // The description of the ROOT above a node; "" when a parent is missing.
+    std::string rootOf(std::string const& description) const
+    {
+        Node* n = byName(description);
+        while (n && n->getSensor() != Node::ROOT)
+            n = parentOf(n);
+        return n ? n->getDescription() : "";
     }
     std::string prop(std::string const& description, std::string const& name) const
     {
@@ -148,27 +148,22 @@ protected:
 TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
 {
     open();
-    std::istringstream in(run("ipmi-sensors -h 127.0.0.1:" + std::to_string(lan_) +
+    std::vector<std::string> const table = ictest::lines(run("ipmi-sensors -h 127.0.0.1:" + std::to_string(lan_) +
                               " -u monitor -p icbmc-secret -W opensesspriv -l operator --quiet-cache "
                               "--sdr-cache-directory " + tmp_.path("cache") + " --output-sensor-thresholds "
                               "--comma-separated-output --no-header-output --output-sensor-state"));
-    std::map<std::string, Node::SensorType> const types{
-        {"Temperature", Node::TemperatureSensor}, {"Fan", Node::Fan}, {"Voltage", Node::VoltageSensor},
-        {"Power Supply", Node::PowerSupply}};
+    std::map<std::string, Node::SensorType> const types{{"Temperature", Node::TemperatureSensor}, {"Fan", Node::Fan},
+        {"Voltage", Node::VoltageSensor}, {"Power Supply", Node::PowerSupply}};
     std::map<std::string, std::string> const states{{"Nominal", "ok"}, {"Warning", "warning"}, {"Critical", "critical"}};
     // ID,Name,Type,State,Reading,Units,Lower NR,Lower C,Lower NC,Upper NC,Upper C,Upper NR,Event
     std::pair<int, char const*> const columns[] = {
         {4, "reading"}, {7, "lower_critical"}, {8, "lower_warning"}, {9, "upper_warning"}, {10, "upper_critical"}};
-    int sensors = 0;
-    for (std::string line; std::getline(in, line); ++sensors) {
-        std::vector<std::string> f;
-        std::istringstream cells(line);
-        for (std::string c; std::getline(cells, c, ',');)
-            f.push_back(c);
+    for (std::string line : table) {
+        std::replace(line.begin(), line.end(), ',', '\n');
+        std::vector<std::string> const f = ictest::lines(line);
         ASSERT_GE(f.size(), 12u) << line;
-        Node* n = byName(f[1]);
-        ASSERT_NE(n, nullptr) << f[1];
-        EXPECT_EQ(n->getSensor(), types.at(f[2])) << f[1];
+        ASSERT_NE(byName(f[1]), nullptr) << f[1];
+        EXPECT_EQ(byName(f[1])->getSensor(), types.at(f[2])) << f[1];
         EXPECT_EQ(prop(f[1], "state"), states.at(f[3])) << f[1];
         for (auto const& [col, name] : columns)
             if (f[col] == "N/A")
@@ -177,11 +172,20 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
                 EXPECT_NEAR(std::stod(prop(f[1], name)), std::stod(f[col]), 0.005) << f[1] << " " << name;
         EXPECT_EQ(prop(f[1], "condition_class"), f[3] == "Nominal" ? "-" : "5") << f[1];
     }
-    EXPECT_EQ(sensors, 8);
-    Node* bmc = byName(bmc_);
-    ASSERT_NE(bmc, nullptr);
-    EXPECT_EQ(ic_->getNodeHierarchy(bmc).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(bmc);
-    EXPECT_EQ(byName("Inlet Temp")->getLinkedId(), bmc->getLinkedId());
+    EXPECT_EQ(table.size(), 8u);
+    ASSERT_NE(byName(bmc_), nullptr);
+    EXPECT_EQ(ic_->getNodeHierarchy(byName(bmc_)).rfind("ROOT:00000000->Chassis:", 0), 0u) << ic_->getNodeHierarchy(byName(bmc_));
+    // Sensors below their entity's node, which has the entity's FRU inventory.
+    std::pair<char const*, char const*> const entities[] = {{"CPU1 Temp", "Processor 1: - - -"}, {"PS2 Status",
+        "Power Supply 2: Voltra VP-800 PSU2-0043"}, {"Inlet Temp", "System Board 1: Icebox Systems ICB-2U Board BRD0001234"}};
+    for (auto const& [sensor, entity] : entities) {
+        Node* e = parentOf(byName(sensor));
+        ASSERT_NE(e, nullptr) << sensor;
+        std::string const d = e->getDescription();
+        EXPECT_EQ(d + ": " + prop(d, "vendor") + " " + prop(d, "model") + " " + prop(d, "serial"), entity);
+        EXPECT_EQ(e->getLinkedId(), byName(bmc_)->getLinkedId()) << sensor;
+    }
+    std::string const ps2 = byName("PS2 Status")->getPath();
     EXPECT_EQ(prop(bmc_, "version") + " " + prop(bmc_, "ipmi_version"), "9.08 2.0"); // as bmc-info says
 
     std::pair<char const*, char const*> const steps[] = {
@@ -195,8 +199,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     std::map<std::string, std::size_t> seen;
     for (auto const& [command, sensor] : steps) {
         console(command);
-        ++seen[sensor];
-        expectAlerts(sensor, std::vector<std::string>(expected[sensor].begin(), expected[sensor].begin() + seen[sensor]));
+        expectAlerts(sensor, std::vector<std::string>(expected[sensor].begin(), expected[sensor].begin() + ++seen[sensor]));
     }
     std::this_thread::sleep_for(std::chrono::milliseconds(600)); // three more polls
     for (auto const& [sensor, list] : expected)
@@ -204,6 +207,7 @@ TEST_F(IpmiTest, NodesMatchIpmiSensorsAndEachChangeRaisesOneAlert)
     open();
     std::this_thread::sleep_for(std::chrono::milliseconds(1000)); // five polls
     EXPECT_EQ(alerts(bmc_), std::vector<std::string>{});
+    EXPECT_EQ(byName("PS2 Status")->getPath(), ps2);
 }
 
 // A stopped BMC: its sensors go unknown with one alert on the BMC node, and
@@ -233,20 +237,15 @@ TEST_F(IpmiTest, StoppedBmcIsUnknownAndComesBack)
 // with linuxhw there is one tree.
 TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
 {
-    std::string const conf = tmp_.path("ipmi.conf");
     std::vector<std::string> expected;
     if (!fs::exists("/dev/ipmi0")) { // else this machine has an in-band BMC
         ictest::EnvGuard none("IC_IPMI_CONFIG", tmp_.path("missing.conf"));
         open();
-        std::vector<Node*> all;
-        ic_->getAllNodes(all);
-        EXPECT_EQ(all.size(), 0u);
-        expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") +
-                           "; reporting nothing");
-        close();
+        EXPECT_EQ(nodes().size(), 0u);
+        expected.push_back("3000 no BMC: no /dev/ipmi0 and no BMC configured in " + tmp_.path("missing.conf") + "; reporting nothing");
     }
     std::string const pw644 = secret("pw644", "icbmc-secret", 0644), wrong = secret("wrong", "nope", 0600);
-    std::string const host = "host = 127.0.0.1:" + std::to_string(lan_) + "\n", e = std::to_string(HGLog::HGLogger::LEVEL_ERROR) + " " + conf;
+    std::string const host = "host = 127.0.0.1:" + std::to_string(lan_) + "\n", e = std::to_string(HGLog::HGLogger::LEVEL_ERROR) + " " + tmp_.path("ipmi.conf");
     tmp_.write("ipmi.conf", "[bmc a]\nhost = 127.0.0.1:70000\n"
                             "[bmc b]\n" + host + "colour = blue\n"
                             "[bmc c]\n" + host + "password_file = /nonexistent/pw\n"
@@ -274,28 +273,35 @@ TEST_F(IpmiTest, NoBmcBadSectionsAndOneTreeWithLinuxhw)
 
     // linuxhw (loaded after ipmi, by file name) adopts the ROOT and Chassis 0.
     std::multiset<std::string> top, roots{"ROOT:00000000", "ROOT:00000000->Chassis:00000000"};
-    std::vector<Node*> all;
-    ic_->getAllNodes(all);
-    for (Node* n : all)
+    for (Node* n : nodes())
         if (n->getSensor() == Node::ROOT || n->getSensor() == Node::Chassis)
             top.insert(ic_->getNodeHierarchy(n));
-    for (std::string const& b : {bmc_, wrongBmc}) {
-        Node* chassis = nullptr;
-        ASSERT_NE(byName(b), nullptr) << b;
-        ASSERT_EQ(ic_->getNode(byName(b)->getLinkedId(), &chassis).getStatus(), 0) << b;
-        roots.insert(ic_->getNodeHierarchy(chassis));
-    }
+    for (std::string const& b : {bmc_, wrongBmc})
+        roots.insert(parentOf(byName(b)) ? ic_->getNodeHierarchy(parentOf(byName(b))) : "no chassis above " + b);
     EXPECT_EQ(top, roots);
+    // ipmi replaced in one reload: linuxhw joins the ROOT the new one reports.
+    std::string const ours = "Server with a BMC", core = "CPU 0 core 0";
+    fs::rename(tmp_.path("mi/ipmi.so"), tmp_.path("mi/ipmi2.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf(core) == ours && rootOf(bmc_) == ours; }, kDeadlineMs));
     // ipmi removed by a reload: linuxhw announces its nodes again below a
     // ROOT and Chassis of its own, so that none is left without its parent.
-    fs::remove(tmp_.path("mi/ipmi.so"));
+    fs::remove(tmp_.path("mi/ipmi2.so"));
     IC::InstCtrl::TimedReload();
-    std::string const coreAt = "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000";
-    auto core = [&] { return byName(bmc_) ? nullptr : byName("CPU 0 core 0"); };
-    EXPECT_TRUE(ictest::eventually([&] { return core() && ic_->getNodeHierarchy(core()) == coreAt; }, kDeadlineMs));
-    ASSERT_NE(core(), nullptr);
-    Node* parent = nullptr;
-    EXPECT_EQ(ic_->getNode(core()->getLinkedId(), &parent).getStatus(), 0);
+    EXPECT_TRUE(ictest::eventually([&] { return !byName(bmc_) && rootOf(core) != "" && rootOf(core) != ours; }, kDeadlineMs));
+    EXPECT_EQ(ic_->getNodeHierarchy(byName(core)), "ROOT:00000000->Chassis:00000000->CPU:00000000->CPU Core:00000000");
+    // The mirror image: ipmi, loaded after linuxhw, adopts its ROOT; linuxhw
+    // removed, ipmi announces every node again below a ROOT of its own.
+    fs::create_symlink(IPMI_PLUGIN, tmp_.path("mi/ipmi.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf(bmc_) == rootOf(core) && rootOf(core) != ""; }, kDeadlineMs));
+    // linuxhw replaced in one reload: ipmi joins the ROOT the new one reports.
+    fs::rename(tmp_.path("mi/linuxhw.so"), tmp_.path("mi/linuxhw2.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return rootOf("Inlet Temp") == rootOf(core) && rootOf(core) != ""; }, kDeadlineMs));
+    fs::remove(tmp_.path("mi/linuxhw2.so"));
+    IC::InstCtrl::TimedReload();
+    EXPECT_TRUE(ictest::eventually([&] { return !byName(core) && rootOf("Inlet Temp") == ours; }, kDeadlineMs));
 }
 
 } // namespace

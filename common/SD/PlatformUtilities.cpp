@@ -545,6 +545,11 @@ std::string PlatformUtilities::getBriscaFPDir()
     return fromEnvironment("IC_FP_DIR", IC_FP_DIR_FROM_LIBDIR, IC_DEFAULT_FP_DIR);
 }
 
+std::string PlatformUtilities::getInstalledPath(char const* fromLibraryDirectory, char const* configured)
+{
+    return installedDirectory(fromLibraryDirectory ? fromLibraryDirectory : "", configured ? configured : "");
+}
+
 _LibraryHandle* PlatformUtilities::loadLibrary(char const* path)
 {
     if (path == nullptr) {

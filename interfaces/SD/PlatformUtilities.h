@@ -21,6 +21,12 @@ public:
     static std::string getBriscaDataDir();
     static std::string getBriscaMIDir();
     static std::string getBriscaFPDir();
+    // A file or directory of the installation found the way the directories
+    // above are: relative to the installed library's own directory
+    // (fromLibraryDirectory, "../etc/x.conf") when it runs installed, so that
+    // a moved installation keeps it; configured in the build tree, or when
+    // fromLibraryDirectory is empty (a path outside the prefix).
+    static std::string getInstalledPath(char const* fromLibraryDirectory, char const* configured);
 
     // Opens a shared library with all its symbols resolved now and kept
     // local to it (RTLD_NOW | RTLD_LOCAL). Returns null, after one log line

@@ -21,8 +21,10 @@
 // - Its removal alerts (release included) name only its own nodes.
 // - When the adopted node goes away (the other plug-in removed by a
 //   reload), the adopter removes its nodes and announces them again below a
-//   ROOT and Chassis of its own (linuxhw does; ipmi, which loads first,
-//   does not yet).
+//   ROOT and Chassis of its own, or, when the record names them already (a
+//   plug-in loaded in the same reload, the other one replaced), below those,
+//   adopted by the record's ids. Its polling thread learns all of it from the
+//   record alone (adoptedTopGone, sharedTop), never from the nodes.
 #pragma once
 
 #include <IC/ManagementInterface.h>
@@ -49,6 +51,22 @@ IC_SHIPPED_API void announceTop(SharedTop const& reported);
 // Clears the record if rootId is still the recorded ROOT.
 IC_SHIPPED_API void withdrawTop(unsigned int rootId);
 IC_SHIPPED_API SharedTop sharedTop();
+
+// True when the ROOT adopted (adoptedRootId; 0: none adopted) is gone: the
+// plug-in that reported it withdrew it as it was released. Reads only the
+// record, so a polling thread may ask.
+inline bool adoptedTopGone(unsigned int adoptedRootId)
+{
+    return adoptedRootId != 0 && sharedTop().rootId != adoptedRootId;
+}
+
+// What a plug-in says (its log line and removal alert) as it takes its
+// nodes back after adoptedTopGone: now is the record as it then reads it.
+inline std::string rehomeMessage(std::string const& plugin, SharedTop const& now)
+{
+    return plugin + (now.rootId != 0 ? ": the shared chassis went away; joining the one reported now"
+                                     : ": the shared chassis went away; reporting a chassis of its own");
+}
 
 // The id of the node at path that another plug-in reports, or 0 when there
 // is none, no look-up, or the record says nobody reports it (recorded: the

@@ -91,6 +91,47 @@ std::string cacheFileIn(std::string const& dir)
     return found;
 }
 
+// The BMC's own address on the IPMB, as the SDR writes it (7 bits, shifted).
+constexpr uint8_t kBmcAddress = 0x20;
+
+// The FRU the current SDR record locates, when the BMC itself serves it: a
+// logical FRU device at the BMC's address, or the BMC's own FRU 0.
+template <class Locator>
+void addFruLocator(ipmi_sdr_ctx_t sdr, uint8_t recordType, std::vector<Locator>& out)
+{
+    uint8_t address = 0, device = 0, bus = 0, lun = 0, logical = 0, channel = 0, eid = 0, einst = 0;
+    if (recordType == IPMI_SDR_FORMAT_FRU_DEVICE_LOCATOR_RECORD) {
+        if (ipmi_sdr_parse_fru_device_locator_parameters(sdr, nullptr, 0, &address, &device, &bus, &lun, &logical,
+                                                         &channel) < 0 ||
+            ipmi_sdr_parse_fru_entity_id_and_instance(sdr, nullptr, 0, &eid, &einst) < 0 || !logical ||
+            (address << 1) != kBmcAddress || bus != 0 || lun != 0 || channel != 0)
+            return;
+        out.push_back({device, eid, einst});
+        return;
+    }
+    uint8_t slave = 0, f[14] = {};
+    if (ipmi_sdr_parse_management_controller_device_locator_parameters(
+            sdr, nullptr, 0, &slave, &channel, &f[0], &f[1], &f[2], &f[3], &f[4], &f[5], &f[6], &f[7], &f[8], &f[9],
+            &f[10], &f[11], &f[12], &f[13]) < 0 ||
+        ipmi_sdr_parse_entity_id_instance_type(sdr, nullptr, 0, &eid, &einst, &bus) < 0)
+        return;
+    // f[9]: the controller is a FRU inventory device (its FRU 0).
+    if ((slave << 1) == kBmcAddress && channel == 0 && f[9])
+        out.push_back({0, eid, einst});
+}
+
+// What tells one SDR cache file from another: name, inode, time and size;
+// "" when there is none.
+std::string cacheStamp(std::string const& dir)
+{
+    std::string const file = cacheFileIn(dir);
+    struct stat st {};
+    if (file.empty() || ::stat(file.c_str(), &st) != 0)
+        return std::string();
+    return file + " " + std::to_string(st.st_ino) + " " + std::to_string(st.st_mtim.tv_sec) + "." +
+           std::to_string(st.st_mtim.tv_nsec) + " " + std::to_string(st.st_size);
+}
+
 } // namespace
 
 BmcReader::BmcReader(BmcConfig config, std::string cacheDir)
@@ -137,6 +178,7 @@ void BmcReader::loadSdrFacts()
     if (file == factsFile_ && st.st_mtime == factsTime_)
         return;
     facts_.clear();
+    frus_.clear();
     factsFile_ = file;
     factsTime_ = st.st_mtime;
     ipmi_sdr_ctx_t sdr = ipmi_sdr_ctx_create();
@@ -159,6 +201,9 @@ void BmcReader::loadSdrFacts()
                 f.entityId = eid;
                 f.entityInstance = einst;
             }
+            if (recordType == IPMI_SDR_FORMAT_FRU_DEVICE_LOCATOR_RECORD ||
+                recordType == IPMI_SDR_FORMAT_MANAGEMENT_CONTROLLER_DEVICE_LOCATOR_RECORD)
+                addFruLocator(sdr, recordType, frus_);
             if (recordType == IPMI_SDR_FORMAT_FULL_SENSOR_RECORD) {
                 uint8_t r[6] = {};
                 double* t[6] = {};
@@ -198,10 +243,18 @@ bool BmcReader::read(std::vector<Sensor>& out, std::string& error)
     }
     ipmi_monitoring_ipmi_config cfg = ipmiConfig();
     unsigned int const flags = IPMI_MONITORING_SENSOR_READING_FLAGS_DISCRETE_READING;
+    std::string const before = cacheStamp(cacheDir_);
     int const n = ipmi_monitoring_sensor_readings_by_record_id(ctx_, hostname(), &cfg, flags, nullptr, 0, nullptr, nullptr);
     if (n < 0) {
         error = ipmi_monitoring_ctx_errormsg(ctx_);
         return false;
+    }
+    // libipmimonitoring downloads the SDR only when the cache is missing or
+    // older than the BMC's repository.
+    if (std::string const after = cacheStamp(cacheDir_); after != before) {
+        ++sdrDownloads_;
+        IPMI_LOG(kDebug, "SDR of ", config_.name.empty() ? "the in-band BMC" : host_, " downloaded (",
+                 sdrDownloads_, " since start): ", after);
     }
     loadSdrFacts();
     out.clear();
@@ -291,6 +344,76 @@ bool fields(ipmi_ctx_t ctx, fiid_template_t tmpl, Command command,
 
 } // namespace
 
+namespace {
+
+// The text of a FRU field, without the padding FRUs often carry and with
+// control characters (a BMC's data is not trusted) shown as '?'; "" when it
+// is empty or cannot be read.
+std::string fruText(ipmi_fru_ctx_t fru, ipmi_fru_field_t const& field, uint8_t language)
+{
+    char text[IPMI_FRU_AREA_STRING_MAX + 1] = {};
+    unsigned int length = IPMI_FRU_AREA_STRING_MAX;
+    if (field.type_length_field_length == 0 ||
+        ipmi_fru_type_length_field_to_string(fru, field.type_length_field, field.type_length_field_length, language,
+                                             text, &length) < 0)
+        return std::string();
+    std::string out(text, std::min<unsigned int>(length, IPMI_FRU_AREA_STRING_MAX));
+    for (char& c : out)
+        if (static_cast<unsigned char>(c) < 0x20 || c == 0x7f)
+            c = '?';
+    // Padding: spaces, or NULs (now '?') after the text.
+    std::size_t const first = out.find_first_not_of(' '), last = out.find_last_not_of(" ?");
+    return last == std::string::npos ? std::string() : out.substr(first, last + 1 - first);
+}
+
+} // namespace
+
+void BmcReader::readInventory(ipmi_ctx_t ctx)
+{
+    inventory_.clear();
+    ipmi_fru_ctx_t fru = ipmi_fru_ctx_create(ctx);
+    if (!fru)
+        return;
+    std::vector<unsigned char> area(IPMI_FRU_AREA_SIZE_MAX + 1);
+    for (FruLocator const& at : frus_) {
+        if (ipmi_fru_open_device_id(fru, static_cast<uint8_t>(at.deviceId)) < 0) {
+            IPMI_LOG(kWarning, "FRU ", at.deviceId, " of ", host_, " cannot be read: ", ipmi_fru_ctx_errormsg(fru));
+            continue;
+        }
+        // The product area names the part that was sold; the board area is
+        // the fall-back (a board often has nothing else).
+        std::string product[3], board[3];
+        do {
+            unsigned int type = 0, length = 0;
+            if (ipmi_fru_read_data_area(fru, &type, &length, area.data(), IPMI_FRU_AREA_SIZE_MAX) < 0)
+                break;
+            uint8_t language = 0;
+            uint32_t made = 0;
+            ipmi_fru_field_t f[7] = {};
+            if (type == IPMI_FRU_AREA_TYPE_PRODUCT_INFO_AREA &&
+                ipmi_fru_product_info_area(fru, area.data(), length, &language, &f[0], &f[1], &f[2], &f[3], &f[4], &f[5],
+                                           &f[6], nullptr, 0) == 0) {
+                product[0] = fruText(fru, f[0], language);
+                product[1] = fruText(fru, f[1], language);
+                product[2] = fruText(fru, f[4], language);
+            } else if (type == IPMI_FRU_AREA_TYPE_BOARD_INFO_AREA &&
+                       ipmi_fru_board_info_area(fru, area.data(), length, &language, &made, &f[0], &f[1], &f[2], &f[3],
+                                                &f[4], nullptr, 0) == 0) {
+                for (int k = 0; k < 3; ++k)
+                    board[k] = fruText(fru, f[k], language);
+            }
+        } while (ipmi_fru_next(fru) == 1);
+        ipmi_fru_close_device_id(fru);
+        Inventory item{at.entityId, at.entityInstance, {}, {}, {}};
+        std::string* fields[3] = {&item.vendor, &item.model, &item.serial};
+        for (int k = 0; k < 3; ++k)
+            *fields[k] = product[k].empty() ? board[k] : product[k];
+        if (!item.vendor.empty() || !item.model.empty() || !item.serial.empty())
+            inventory_.push_back(std::move(item));
+    }
+    ipmi_fru_ctx_destroy(fru);
+}
+
 bool BmcReader::newEvents(std::vector<SelEvent>& out, std::string& error)
 {
     std::string const stateFile = cacheDir_ + "/sel-seen";
@@ -300,13 +423,20 @@ bool BmcReader::newEvents(std::vector<SelEvent>& out, std::string& error)
     bool const wantId = firmware_.empty();
     uint64_t major = 0, minor = 0, ipmiMajor = 0, ipmiMinor = 0;
     if (!withSession(config_, hostname(), error, [&](ipmi_ctx_t ctx) {
-            return fields(ctx, tmpl_cmd_get_sel_info_rs, ipmi_cmd_get_sel_info,
-                          {{"most_recent_addition_timestamp", &added}, {"most_recent_erase_timestamp", &erased}}) &&
-                   (!wantId || fields(ctx, tmpl_cmd_get_device_id_rs, ipmi_cmd_get_device_id,
-                                      {{"firmware_revision1.major_revision", &major},
-                                       {"firmware_revision2.minor_revision", &minor},
-                                       {"ipmi_version_major", &ipmiMajor},
-                                       {"ipmi_version_minor", &ipmiMinor}}));
+            if (!fields(ctx, tmpl_cmd_get_sel_info_rs, ipmi_cmd_get_sel_info,
+                        {{"most_recent_addition_timestamp", &added}, {"most_recent_erase_timestamp", &erased}}))
+                return false;
+            if (!wantId)
+                return true;
+            // Versions and inventory do not change while the BMC runs: asked once.
+            if (!fields(ctx, tmpl_cmd_get_device_id_rs, ipmi_cmd_get_device_id,
+                        {{"firmware_revision1.major_revision", &major},
+                         {"firmware_revision2.minor_revision", &minor},
+                         {"ipmi_version_major", &ipmiMajor},
+                         {"ipmi_version_minor", &ipmiMinor}}))
+                return false;
+            readInventory(ctx);
+            return true;
         }))
         return false;
     now.added = added;

@@ -10,6 +10,8 @@
 #include <ipmi_monitoring.h>
 #include <ipmi_monitoring_bitmasks.h>
 
+#include <freeipmi/api/ipmi-api.h>
+
 #include <array>
 #include <ctime>
 #include <map>
@@ -31,6 +33,13 @@ struct Sensor {
     std::array<std::optional<double>, 4> thresholds;
     std::string state; // ok, warning, critical, unknown
     std::string event; // FreeIPMI's words for what the sensor says
+};
+
+// What a FRU of the BMC says about the entity it belongs to.
+struct Inventory {
+    unsigned int entityId = 0;
+    unsigned int entityInstance = 0;
+    std::string vendor, model, serial; // "" when the FRU does not say
 };
 
 // A new record of the BMC's event log (SEL).
@@ -67,8 +76,14 @@ public:
     // The BMC's firmware and IPMI versions ("" until newEvents has asked).
     std::string const& firmware() const { return firmware_; }
     std::string const& ipmiVersion() const { return ipmiVersion_; }
+    // The FRU inventory of the entities the SDR names FRUs for, read once
+    // with the versions; empty until then or when the BMC keeps none.
+    std::vector<Inventory> const& inventory() const { return inventory_; }
 
     BmcConfig const& config() const { return config_; }
+    // How many times read() found the SDR downloaded anew (logged at debug
+    // level): once on a cold cache, then only when the BMC's SDR changed.
+    unsigned int sdrDownloads() const { return sdrDownloads_; }
 
 private:
     struct SdrFacts {
@@ -77,7 +92,15 @@ private:
         bool sensor = false; // a sensor record, not a locator or OEM one
         std::array<std::optional<double>, 4> thresholds;
     };
+    // A FRU the BMC itself serves (a logical FRU device at its address) and
+    // the entity it describes.
+    struct FruLocator {
+        unsigned int deviceId = 0;
+        unsigned int entityId = 0;
+        unsigned int entityInstance = 0;
+    };
     void loadSdrFacts();
+    void readInventory(ipmi_ctx_t ctx);
     ipmi_monitoring_ipmi_config ipmiConfig() const;
     char const* hostname() const;
 
@@ -85,11 +108,14 @@ private:
     std::string const cacheDir_;
     ipmi_monitoring_ctx_t ctx_ = nullptr;
     std::map<int, SdrFacts> facts_; // by SDR record id, for this cache file
+    std::vector<FruLocator> frus_;  // from the same SDR
     std::string factsFile_;
     std::time_t factsTime_ = 0;
     std::string host_; // "host:port"; unused in-band
     std::string firmware_;
     std::string ipmiVersion_;
+    std::vector<Inventory> inventory_;
+    unsigned int sdrDownloads_ = 0;
 };
 
 } // namespace ipmi

@@ -8,14 +8,18 @@
 
 #include <SD/PlatformUtilities.h>
 
+#include <freeipmi/freeipmi.h>
+
 #include <sys/stat.h>
 
 #include <cstdio>
 #include <filesystem>
 #include <cstdlib>
+#include <system_error>
 
 #ifndef IC_IPMI_DEFAULT_CONFIG
 #define IC_IPMI_DEFAULT_CONFIG "/etc/instrumentationcontrol/ipmi.conf"
+#define IC_IPMI_CONFIG_FROM_LIBDIR ""
 #endif
 
 namespace ipmi {
@@ -59,6 +63,27 @@ Node::SensorType typeOf(int ipmiType)
     case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG1:
     case IPMI_MONITORING_SENSOR_TYPE_WATCHDOG2: return Node::BMC;
     default: return Node::PFASensor;
+    }
+}
+
+// The node type of an IPMI entity that gets a node of its own, grouping its
+// sensors and carrying its FRU inventory (README.md has the table); Unknown
+// for the others, whose sensors hang below the chassis.
+Node::SensorType entityTypeOf(unsigned int entityId)
+{
+    switch (entityId) {
+    case IPMI_ENTITY_ID_PROCESSOR:
+    case IPMI_ENTITY_ID_PROCESSOR_MODULE: return Node::CPU;
+    case IPMI_ENTITY_ID_SYSTEM_BOARD: return Node::Planar;
+    case IPMI_ENTITY_ID_MEMORY_MODULE:
+    case IPMI_ENTITY_ID_MEMORY_DEVICE: return Node::DIMM;
+    case IPMI_ENTITY_ID_POWER_SUPPLY:
+    case IPMI_ENTITY_ID_POWER_MODULE_DC_TO_DC_CONVERTER: return Node::PowerSupply;
+    case IPMI_ENTITY_ID_POWER_UNIT_POWER_DOMAIN: return Node::PowerDomain;
+    case IPMI_ENTITY_ID_COOLING_UNIT_COOLING_DOMAIN: return Node::CoolingDomain;
+    case IPMI_ENTITY_ID_FRONT_PANEL_BOARD: return Node::FrontPanel;
+    case IPMI_ENTITY_ID_BACK_PANEL_BOARD: return Node::BackPanel;
+    default: return Node::Unknown;
     }
 }
 
@@ -128,7 +153,8 @@ IpmiMI::Node* IpmiMI::newNode(Node::SensorType type, unsigned int instance, unsi
 IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
 {
     char const* env = std::getenv("IC_IPMI_CONFIG");
-    std::string const configPath = env && *env ? env : IC_IPMI_DEFAULT_CONFIG;
+    std::string const configPath =
+        env && *env ? env : SD::PlatformUtilities::getInstalledPath(IC_IPMI_CONFIG_FROM_LIBDIR, IC_IPMI_DEFAULT_CONFIG);
     std::vector<BmcConfig> configs = readConfig(configPath);
     struct stat st {};
     bool const inBand = ::stat("/dev/ipmi0", &st) == 0 && S_ISCHR(st.st_mode);
@@ -157,6 +183,8 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     shipped::SharedTop const top = shipped::sharedTop();
     unsigned int rootId = shipped::adoptedNodeId(lookup_, top.rootId, shipped::kRootPath);
     unsigned int chassisId = shipped::adoptedNodeId(lookup_, top.chassisId, shipped::kChassisPath);
+    adoptedRootId_ = rootId;
+    adoptedChassisId_ = chassisId;
     if (rootId == 0) {
         rootId = ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
         if (chassisId == 0)
@@ -165,6 +193,7 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
     } else if (chassisId == 0) {
         chassisId = newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
     }
+    chassisId_ = chassisId;
     std::set<unsigned int> chassisInstances{0};
     for (BmcConfig& c : configs) {
         auto b = std::make_unique<Bmc>();
@@ -185,9 +214,18 @@ IC::Error IpmiMI::Initialize(unsigned int nodeIdBase, IC::Number, IC::Number)
         b->reader = std::make_unique<BmcReader>(std::move(c), dir);
         bmcs_.push_back(std::move(b));
     }
-    thread_ = std::thread([this] { run(); });
+    // One thread per BMC: each has its own session, and one that does not
+    // answer holds up only its own readings.
+    for (auto& b : bmcs_) {
+        try {
+            b->thread = std::thread([this, bmc = b.get()] { run(*bmc); });
+        } catch (std::system_error const& e) {
+            ++firstPasses_; // nothing to wait for
+            IPMI_LOG(kError, "no thread to read ", b->label, " (", e.what(), "); it is not read");
+        }
+    }
     // Open waits for one pass, but not for a BMC that does not answer.
-    if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return passes_ > 0; }))
+    if (!wake_.wait_for(g, std::chrono::milliseconds(kOpenWaitMs), [this] { return firstPasses_ == bmcs_.size(); }))
         IPMI_LOG(kWarning, "the BMCs did not all answer within ", kOpenWaitMs,
                  " ms; their sensors are reported when they do");
     IPMI_LOG(kProgress, "reporting ", order_.size(), " nodes from ", bmcs_.size(), " BMCs, polling every ",
@@ -203,31 +241,31 @@ IC::Error IpmiMI::getMap(std::vector<IC::Node*>& nodes)
     return ok();
 }
 
-void IpmiMI::run()
+void IpmiMI::run(Bmc& b)
 {
+    // bmcs_ is fixed once the threads run; b's reader is this thread's.
     std::unique_lock<std::mutex> g(lock_);
-    while (!stopping_) {
+    for (bool first = true; !stopping_; first = false) {
+        Outbox moved;
+        // The adopted ROOT is gone once the plug-in that reported it withdrew
+        // it (it was released); its node is never touched from here.
+        // Whichever thread sees it first moves every BMC's nodes.
+        if (mapped_ && shipped::adoptedTopGone(adoptedRootId_))
+            rehome(moved);
+        bool const due = std::chrono::steady_clock::now() >= b.nextTry;
         g.unlock();
-        pass();
+        deliver(moved);
+        if (due) {
+            Outbox out;
+            readBmc(b, out);
+            deliver(out);
+        }
         g.lock();
-        ++passes_;
-        wake_.notify_all();
+        if (first) {
+            ++firstPasses_;
+            wake_.notify_all();
+        }
         wake_.wait_for(g, std::chrono::milliseconds(pollMs_), [this] { return stopping_; });
-    }
-}
-
-void IpmiMI::pass()
-{
-    // bmcs_ is fixed once the thread runs; each BMC's reader is this thread's.
-    for (auto& b : bmcs_) {
-        if (std::chrono::steady_clock::now() < b->nextTry)
-            continue;
-        Outbox out;
-        readBmc(*b, out);
-        deliver(out);
-        std::lock_guard<std::mutex> g(lock_);
-        if (stopping_)
-            return;
     }
 }
 
@@ -288,13 +326,13 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
         auto it = b.sensors.find(key);
         if (it == b.sensors.end()) {
             Node::SensorType const type = typeOf(s.type);
+            Node const* entity = entityNode(b, s.entityId, s.entityInstance, out);
+            unsigned int const parent = entity ? entity->getNodeId() : b.parentId;
             // Identity from facts that survive restarts and SDR reorders:
             // entity id, entity instance and name, never the record id.
-            unsigned int instance = digest(key);
-            while (!b.instances.emplace(type, instance).second)
-                ++instance;
+            unsigned int const instance = claimInstance(b, parent, type, digest(key));
             it = b.sensors.emplace(key, Tracked()).first;
-            it->second.node = newNode(type, instance, b.parentId, s.name);
+            it->second.node = newNode(type, instance, parent, s.name);
             it->second.node->setProperty("entity", std::to_string(s.entityId) + "." + std::to_string(s.entityInstance));
             if (mapped_)
                 out.arrivals.push_back(it->second.node);
@@ -313,6 +351,15 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
                                     s.state + (s.event.empty() ? "" : ": " + s.event);
         judge(it->second, s.state, message, out);
     }
+    if (!b.inventoryShown && !b.reader->inventory().empty()) {
+        b.inventoryShown = true;
+        for (Inventory const& item : b.reader->inventory())
+            if (Node* n = entityNode(b, item.entityId, item.entityInstance, out))
+                for (auto const& [name, value] : {std::pair{"vendor", &item.vendor}, {"model", &item.model},
+                                                  {"serial", &item.serial}})
+                    if (!value->empty())
+                        n->setProperty(name, *value);
+    }
     std::string const bmcPath = b.bmcNode.node->knownPath();
     for (SelEvent const& e : events) {
         unsigned char const severity = e.state == IPMI_MONITORING_STATE_CRITICAL  ? shipped::kSeverityCritical
@@ -323,6 +370,82 @@ void IpmiMI::readBmc(Bmc& b, Outbox& out)
             out.alerts.emplace_back(severity, shipped::kEventLog, std::vector<std::string>{bmcPath},
                                     shipped::kStatusNormal, b.label + " " + e.text);
     }
+}
+
+void IpmiMI::rehome(Outbox& out)
+{
+    // Our nodes hang below a ROOT (and maybe a Chassis) the library no longer
+    // has: take them back and announce them again below our own, or below
+    // those a plug-in loaded in the same reload reports already (adopted by
+    // the ids of the record alone: their nodes are not touched from here).
+    shipped::SharedTop const now = shipped::sharedTop();
+    bool const ownChassis = adoptedChassisId_ == 0; // ours stays, relinked
+    std::vector<std::string> paths;
+    for (Node const* n : order_)
+        if (std::string path = n->knownPath(); !path.empty())
+            paths.push_back(std::move(path));
+    std::string const message = shipped::rehomeMessage("ipmi", now);
+    IPMI_LOG(kWarning, message);
+    if (!paths.empty())
+        out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
+                                  message);
+    std::vector<Node*> const announced = order_;
+    if (now.rootId == 0)
+        ownRootId_ = newNode(Node::ROOT, 0, 0, "Server with a BMC")->getNodeId();
+    unsigned int const rootId = now.rootId != 0 ? now.rootId : ownRootId_;
+    unsigned int const chassisId = ownChassis                          ? chassisId_
+                                   : now.rootId != 0 && now.chassisId != 0 ? now.chassisId
+                                       : newNode(Node::Chassis, 0, rootId, "This server")->getNodeId();
+    out.arrivals.assign(order_.begin() + static_cast<std::ptrdiff_t>(announced.size()), order_.end());
+    auto const moved = [&](unsigned int id) {
+        return id == adoptedRootId_ ? rootId : id == adoptedChassisId_ && id != 0 ? chassisId : id;
+    };
+    for (Node* n : announced) {
+        n->setLinkedId(moved(n->getLinkedId()));
+        out.arrivals.push_back(n);
+    }
+    for (auto& b : bmcs_) {
+        b->parentId = moved(b->parentId);
+        decltype(b->instances) claims;
+        for (auto const& [parent, type, instance] : b->instances)
+            claims.emplace(moved(parent), type, instance);
+        b->instances.swap(claims);
+    }
+    adoptedRootId_ = now.rootId;
+    adoptedChassisId_ = chassisId == now.chassisId && !ownChassis ? chassisId : 0;
+    chassisId_ = chassisId;
+    if (now.rootId == 0)
+        shipped::announceTop({rootId, chassisId});
+}
+
+unsigned int IpmiMI::claimInstance(Bmc& b, unsigned int parent, Node::SensorType type, unsigned int wanted)
+{
+    while (!b.instances.emplace(parent, type, wanted).second)
+        wanted = (wanted + 1) & 0xFFFF;
+    return wanted;
+}
+
+IpmiMI::Node* IpmiMI::entityNode(Bmc& b, unsigned int entityId, unsigned int entityInstance, Outbox& out)
+{
+    Node::SensorType const type = entityTypeOf(entityId);
+    if (type == Node::Unknown)
+        return nullptr;
+    auto const key = std::make_pair(entityId, entityInstance);
+    if (auto const found = b.entities.find(key); found != b.entities.end())
+        return found->second;
+    // The entity's own instance number; two entities of one node type with
+    // the same number (a processor and a processor module) keep both facts.
+    unsigned int const wanted = b.instances.count({b.parentId, type, entityInstance}) == 0
+                                    ? entityInstance
+                                    : (entityId << 8 | entityInstance);
+    char const* name = ipmi_get_entity_id_string(static_cast<uint8_t>(entityId));
+    Node* n = newNode(type, claimInstance(b, b.parentId, type, wanted), b.parentId,
+                      std::string(name ? name : "Entity") + " " + std::to_string(entityInstance));
+    n->setProperty("entity", std::to_string(entityId) + "." + std::to_string(entityInstance));
+    b.entities.emplace(key, n);
+    if (mapped_)
+        out.arrivals.push_back(n);
+    return n;
 }
 
 void IpmiMI::deliver(Outbox& out)
@@ -337,6 +460,8 @@ void IpmiMI::deliver(Outbox& out)
         arrivalContext = arrivalContext_;
         alertContext = alertContext_;
     }
+    if (alert && !out.removals.empty())
+        alert(out.removals, alertContext);
     for (Node* n : out.arrivals) {
         if (!arrival)
             break;
@@ -356,8 +481,9 @@ void IpmiMI::stop()
         stopping_ = true;
     }
     wake_.notify_all();
-    if (thread_.joinable())
-        thread_.join();
+    for (auto& b : bmcs_)
+        if (b->thread.joinable())
+            b->thread.join();
 }
 
 IC::Error IpmiMI::shutdown()

@@ -13,6 +13,7 @@ inline std::string const& logger()
     return name;
 }
 
+constexpr int kDebug = HGLog::HGLogger::LEVEL_DEBUG;
 constexpr int kProgress = HGLog::HGLogger::LEVEL_PROGRESS;
 constexpr int kWarning = HGLog::HGLogger::LEVEL_WARNING;
 constexpr int kError = HGLog::HGLogger::LEVEL_ERROR;

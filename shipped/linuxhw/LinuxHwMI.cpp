@@ -234,7 +234,7 @@ void LinuxHwMI::poll()
     {
         SD::MutexGuard g(lock_);
         auto const root = adopted_.find(kRootKey);
-        orphaned = root != adopted_.end() && shipped::sharedTop().rootId != root->second;
+        orphaned = root != adopted_.end() && shipped::adoptedTopGone(root->second);
     }
     DeviceList fixed;
     if (orphaned) {
@@ -253,7 +253,10 @@ void LinuxHwMI::poll()
 void LinuxHwMI::rehome(DeviceList& fixed, Outbox& out)
 {
     // Our nodes hang below a chassis the library no longer has: take them
-    // back and announce them again below a ROOT and Chassis of our own.
+    // back and announce them again below a ROOT and Chassis of our own, or
+    // below those a plug-in loaded in the same reload reports already
+    // (adopted by the record's ids alone: their nodes are not touched here).
+    shipped::SharedTop const now = shipped::sharedTop();
     std::vector<std::string> paths;
     for (std::string const& key : order_) {
         Tracked& t = tracked_.at(key);
@@ -262,12 +265,17 @@ void LinuxHwMI::rehome(DeviceList& fixed, Outbox& out)
             paths.push_back(std::move(path));
         t.present = false;
     }
-    std::string const message = "linuxhw: the shared chassis went away; reporting a chassis of its own";
+    std::string const message = shipped::rehomeMessage("linuxhw", now);
     LHW_LOG(kWarning, message);
     if (!paths.empty())
         out.removals.emplace_back(shipped::kSeverityInfo, shipped::kNodeRemoval, paths, shipped::kStatusNormal,
                                   message);
     adopted_.clear();
+    if (now.rootId != 0) {
+        adopted_[kRootKey] = now.rootId;
+        if (now.chassisId != 0)
+            adopted_[kChassisKey] = now.chassisId;
+    }
     reconcile(fixed, false, true, out);
     announceOwnTop();
 }

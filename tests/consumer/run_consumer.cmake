@@ -74,9 +74,15 @@ if(PRODUCT)
   set(ENV{IC_SYSFS_ROOT} ${SOURCE_DIR}/examples/sysfs/small)
   unset(ENV{IC_MI_DIR})
   unset(ENV{IC_FP_DIR})
-  execute_process(COMMAND ${moved}/bin/icctl --json nodes
+  unset(ENV{IC_IPMI_CONFIG})
+  execute_process(COMMAND ${moved}/bin/icctl -v --json nodes
     RESULT_VARIABLE rc OUTPUT_VARIABLE out ERROR_VARIABLE err)
   if(NOT rc EQUAL 0 OR NOT out MATCHES "Temperature Sensor")
     message(FATAL_ERROR "the moved icctl did not show the example's sensors (${rc}):\n${out}\n${err}")
+  endif()
+  # ipmi's configuration moved with the tree too.
+  file(GLOB ipmi ${moved}/lib*/instrumentationcontrol/mi/ipmi.so ${moved}/lib/*/instrumentationcontrol/mi/ipmi.so)
+  if(ipmi AND NOT EXISTS /dev/ipmi0 AND NOT err MATCHES "configured in ${moved}/etc/instrumentationcontrol/ipmi.conf")
+    message(FATAL_ERROR "the moved ipmi did not look for its configuration below ${moved}/etc:\n${err}")
   endif()
 endif()
