@@ -4,9 +4,12 @@
 #include <HGLog/HGLogger.h>
 
 #include "../frame/HexText.h"
+#include "FlatIndex.h"
 
 #include <algorithm>
 #include <iterator>
+#include <map>
+#include <unordered_map>
 #include <stdexcept>
 #include <utility>
 
@@ -54,9 +57,159 @@ void appendListed(std::vector<Node*> const& listed, std::vector<Node*>& nodes)
                  [](Node* n) { return n != nullptr; });
 }
 
+// Hashes a path a byte at a time (FNV-1a), then spreads the result into the
+// upper bits the index takes its home slots from. A look-up's path is a copy
+// its caller has just written (getNode takes it by value); reading those
+// bytes in wider words than they were written in cannot be served from the
+// pending writes, which holds each look-up back until the previous one has
+// finished its memory accesses.
+std::uint32_t pathHash(std::string const& path)
+{
+    std::uint64_t h = 14695981039346656037ull;
+    for (char c : path)
+        h = (h ^ static_cast<unsigned char>(c)) * 1099511628211ull;
+    return static_cast<std::uint32_t>((h * 0x9E3779B97F4A7C15ull) >> 32);
+}
+
+std::uint32_t idHash(unsigned int id)
+{
+    return static_cast<std::uint32_t>((id * 0x9E3779B97F4A7C15ull) >> 32);
+}
+
+std::uint32_t const kNoPath = 0xFFFFFFFF;
+
 } // namespace
 
-NodeStore::NodeStore() = default;
+// Every path the store knows is held once, as a record: the path index
+// finds it by its text, and the cached path of a node id names it.
+// A record lives while a node is registered under it or an id caches it.
+struct NodeStore::Indexes {
+    struct PathRecord {
+        std::string text;
+        Node* owner = nullptr;     // registered under this path, if any
+        std::uint32_t caches = 0;  // node ids whose cached path this is
+    };
+
+    // Records in blocks that never move, numbered so that index slots stay
+    // small; freed numbers are used again.
+    class Records {
+    public:
+        PathRecord& operator[](std::uint32_t r) { return blocks[r >> kBits][r & (kBlock - 1)]; }
+        PathRecord const& operator[](std::uint32_t r) const
+        {
+            return blocks[r >> kBits][r & (kBlock - 1)];
+        }
+        std::uint32_t add(std::string const& text)
+        {
+            std::uint32_t r = 0;
+            if (!freed.empty()) {
+                r = freed.back();
+                freed.pop_back();
+            } else {
+                if (used % kBlock == 0)
+                    blocks.push_back(std::make_unique<PathRecord[]>(kBlock));
+                r = used++;
+            }
+            (*this)[r].text = text;
+            return r;
+        }
+        void free(std::uint32_t r)
+        {
+            (*this)[r] = PathRecord();
+            freed.push_back(r);
+        }
+        void clear()
+        {
+            blocks.clear();
+            freed.clear();
+            used = 0;
+        }
+
+    private:
+        static constexpr unsigned int kBits = 10;
+        static constexpr std::uint32_t kBlock = 1u << kBits;
+        std::vector<std::unique_ptr<PathRecord[]> > blocks;
+        std::vector<std::uint32_t> freed;
+        std::uint32_t used = 0;
+    };
+
+    // What the store knows under one node id: the registered node (the id
+    // index) and the cached path (the path cache); at least one of them.
+    struct IdSlot {
+        unsigned int id = 0;
+        std::uint32_t path = kNoPath;
+        Node* node = nullptr;
+        bool empty() const { return node == nullptr && path == kNoPath; }
+        std::uint32_t hash() const { return idHash(id); }
+    };
+    struct PathSlot {
+        std::uint32_t h = 0;
+        std::uint32_t record = kNoPath;
+        bool empty() const { return record == kNoPath; }
+        std::uint32_t hash() const { return h; }
+    };
+
+    // The nodes of one sensor type in order of addition. A removed node
+    // leaves a hole until holes outnumber nodes; positions finds a node's
+    // places without a search.
+    struct TypeList {
+        std::vector<Node*> nodes;
+        std::unordered_multimap<Node*, std::size_t> positions;
+    };
+
+    IdSlot* id(unsigned int key)
+    {
+        return ids.find(idHash(key), [key](IdSlot const& s) { return s.id == key; });
+    }
+    IdSlot const* id(unsigned int key) const
+    {
+        return ids.find(idHash(key), [key](IdSlot const& s) { return s.id == key; });
+    }
+
+    PathSlot const* path(std::string const& text, std::uint32_t h) const
+    {
+        return paths.find(h, [this, &text, h](PathSlot const& s) {
+            return s.h == h && records[s.record].text == text;
+        });
+    }
+    // The node registered under text, or null.
+    Node* owner(std::string const& text) const
+    {
+        PathSlot const* s = path(text, pathHash(text));
+        return s ? records[s->record].owner : nullptr;
+    }
+    // The record of text, made if there is none.
+    std::uint32_t record(std::string const& text)
+    {
+        std::uint32_t const h = pathHash(text);
+        if (PathSlot const* s = path(text, h))
+            return s->record;
+        std::uint32_t const r = records.add(text);
+        paths.insert(PathSlot{h, r});
+        return r;
+    }
+    // Frees the record once nothing holds it.
+    void release(std::uint32_t r)
+    {
+        PathRecord const& rec = records[r];
+        if (rec.owner || rec.caches != 0)
+            return;
+        std::uint32_t const h = pathHash(rec.text);
+        paths.erase(paths.find(h, [r](PathSlot const& s) { return s.record == r; }));
+        records.free(r);
+    }
+
+    // By sensor type (ascending): what getMap lists.
+    std::map<Node::SensorType, TypeList> sensorMap;
+    detail::FlatIndex<IdSlot> ids;
+    detail::FlatIndex<PathSlot> paths;
+    Records records;
+    // The records each node is registered under, so that removing a node
+    // needs no walk of the path index.
+    std::unordered_multimap<Node*, std::uint32_t> pathsOfNode;
+};
+
+NodeStore::NodeStore() : index(std::make_unique<Indexes>()) {}
 
 NodeStore::~NodeStore()
 {
@@ -67,22 +220,23 @@ NodeStore::~NodeStore()
 
 Node* NodeStore::registeredNode(unsigned int id) const
 {
-    auto it = idMap.find(id);
-    return it == idMap.end() ? nullptr : it->second.node;
+    Indexes::IdSlot const* s = index->id(id);
+    return s ? s->node : nullptr;
 }
 
 std::string const* NodeStore::cachedPath(unsigned int id) const
 {
-    auto it = idMap.find(id);
-    return it == idMap.end() || it->second.path.empty() ? nullptr : &it->second.path;
+    Indexes::IdSlot const* s = index->id(id);
+    return s && s->path != kNoPath ? &index->records[s->path].text : nullptr;
 }
 
 void NodeStore::unlist(Node* node)
 {
+    auto& sensorMap = index->sensorMap;
     auto type = sensorMap.find(static_cast<Node::SensorType>(*node));
     if (type == sensorMap.end())
         return;
-    TypeList& listed = type->second;
+    Indexes::TypeList& listed = type->second;
     // The node's first place in order of addition goes.
     auto range = listed.positions.equal_range(node);
     if (range.first == range.second)
@@ -117,7 +271,7 @@ void NodeStore::unlist(Node* node)
 
 void NodeStore::list(Node* node)
 {
-    TypeList& listed = sensorMap[static_cast<Node::SensorType>(*node)];
+    Indexes::TypeList& listed = index->sensorMap[static_cast<Node::SensorType>(*node)];
     listed.positions.emplace(node, listed.nodes.size());
     listed.nodes.push_back(node);
 }
@@ -151,7 +305,7 @@ Error NodeStore::addNodeIfNew(Node* const& node, bool& isNew)
     // exactly as computing it again would.
     std::vector<PendingPath> pending;
     std::string const path = walkPath(node, &pending);
-    if (nodePathMap.count(path) != 0)
+    if (index->owner(path))
         return status(0);
     // Listed before the id is entered, and kept even if the id is taken.
     list(node);
@@ -172,7 +326,7 @@ Error NodeStore::addMINode(std::vector<Node*> const& nodes)
         }
         pending.clear();
         std::string const path = walkPath(node, &pending);
-        if (nodePathMap.count(path) == 0)
+        if (!index->owner(path))
             result = add2NodeMapWalked(node, path, pending);
         else
             result = status(6);
@@ -191,10 +345,12 @@ Error NodeStore::add2NodeMapWalked(Node* node, std::string const& path,
                                    std::vector<PendingPath> const& pending)
 {
     unsigned int const id = node->getNodeId();
-    IdEntry& entry = idMap[id];
-    bool const inserted = entry.node == nullptr;
-    if (inserted)
-        entry.node = node;
+    Indexes::IdSlot* const entry = index->id(id);
+    bool const inserted = !entry || !entry->node;
+    if (!entry)
+        index->ids.insert(Indexes::IdSlot{id, kNoPath, node});
+    else if (inserted)
+        entry->node = node;
 
     cachePaths(pending);
     node->setPath(path);
@@ -235,27 +391,33 @@ Error NodeStore::delNode(Node* const& node)
 
 void NodeStore::delOneNode(Node* const& node)
 {
-    auto byId = idMap.find(node->getNodeId());
-    if (byId != idMap.end()) {
-        byId->second.node = nullptr;
-        if (byId->second.path.empty())
-            idMap.erase(byId);
+    Indexes& ix = *index;
+    if (Indexes::IdSlot* byId = ix.id(node->getNodeId())) {
+        byId->node = nullptr;
+        if (byId->path == kNoPath)
+            ix.ids.erase(byId);
     }
-    byId = idMap.find(node->getNodeId());
-    if (byId != idMap.end()) {
-        byId->second.path.clear();
-        if (!byId->second.node)
-            idMap.erase(byId);
+    if (Indexes::IdSlot* byId = ix.id(node->getNodeId())) {
+        std::uint32_t const cached = byId->path;
+        byId->path = kNoPath;
+        if (!byId->node)
+            ix.ids.erase(byId);
+        if (cached != kNoPath) {
+            --ix.records[cached].caches;
+            ix.release(cached);
+        }
     }
     // Of the paths that lead to this node, the smallest goes.
-    auto range = pathsOfNode.equal_range(node);
+    auto range = ix.pathsOfNode.equal_range(node);
     if (range.first != range.second) {
         auto smallest = range.first;
         for (auto it = range.first; it != range.second; ++it)
-            if (*it->second < *smallest->second)
+            if (ix.records[it->second].text < ix.records[smallest->second].text)
                 smallest = it;
-        nodePathMap.erase(nodePathMap.find(*smallest->second));
-        pathsOfNode.erase(smallest);
+        std::uint32_t const r = smallest->second;
+        ix.pathsOfNode.erase(smallest);
+        ix.records[r].owner = nullptr;
+        ix.release(r);
     }
     unlist(node);
 }
@@ -281,10 +443,11 @@ void NodeStore::clear()
     // Callers need not hold the lock; taking it costs nothing when they do
     // and keeps a first open safe against a client still querying.
     Guard guard(storeLock);
-    pathsOfNode.clear();
-    nodePathMap.clear();
-    idMap.clear();
-    sensorMap.clear();
+    index->pathsOfNode.clear();
+    index->paths.clear();
+    index->records.clear();
+    index->ids.clear();
+    index->sensorMap.clear();
 }
 
 Error NodeStore::getNode(unsigned int id, Node** node) const
@@ -292,20 +455,20 @@ Error NodeStore::getNode(unsigned int id, Node** node) const
     // Looked up here rather than through nodeId2Node: an exported member is
     // called through the procedure linkage table, which this path avoids.
     Guard guard(storeLock);
-    auto it = idMap.find(id);
-    if (it == idMap.end() || !it->second.node)
+    Indexes::IdSlot const* const s = index->id(id);
+    if (!s || !s->node)
         return notFound();
-    *node = it->second.node;
+    *node = s->node;
     return found();
 }
 
 Error NodeStore::getNode(std::string path, Node** node) const
 {
     Guard guard(storeLock);
-    auto it = nodePathMap.find(path);
-    if (it == nodePathMap.end())
+    Node* const owner = index->owner(path);
+    if (!owner)
         return notFound();
-    *node = it->second;
+    *node = owner;
     return found();
 }
 
@@ -320,10 +483,10 @@ Error NodeStore::nodeId2Node(unsigned int id, Node** node) const
 
 Error NodeStore::nodePath2Node(std::string path, Node** node) const
 {
-    auto it = nodePathMap.find(path);
-    if (it == nodePathMap.end())
+    Node* const owner = index->owner(path);
+    if (!owner)
         return notFound();
-    *node = it->second;
+    *node = owner;
     return found();
 }
 
@@ -331,7 +494,7 @@ Error NodeStore::getMap(std::vector<Node*>& nodes) const
 {
     Guard guard(storeLock);
     nodes.clear();
-    for (auto const& type : sensorMap)
+    for (auto const& type : index->sensorMap)
         appendListed(type.second.nodes, nodes);
     return found();
 }
@@ -340,6 +503,7 @@ Error NodeStore::getMap(std::vector<Node*>& nodes, unsigned int sensor) const
 {
     Guard guard(storeLock);
     nodes.clear();
+    auto const& sensorMap = index->sensorMap;
     auto type = sensorMap.find(static_cast<Node::SensorType>(sensor));
     if (type != sensorMap.end())
         appendListed(type->second.nodes, nodes);
@@ -351,10 +515,11 @@ Error NodeStore::getAllNodes(std::vector<Node*>& nodes) const
     std::vector<std::pair<unsigned int, Node*> > byId;
     {
         Guard guard(storeLock);
-        byId.reserve(idMap.size());
-        for (auto const& entry : idMap)
-            if (entry.second.node)
-                byId.emplace_back(entry.first, entry.second.node);
+        byId.reserve(index->ids.size());
+        index->ids.forEach([&byId](Indexes::IdSlot const& s) {
+            if (s.node)
+                byId.emplace_back(s.id, s.node);
+        });
     }
     std::sort(byId.begin(), byId.end(),
               [](auto const& a, auto const& b) { return a.first < b.first; });
@@ -384,13 +549,23 @@ void NodeStore::cachePaths(std::vector<PendingPath> const& pending)
 {
     // Neither index is overwritten: a cached path stays, and the first node
     // to claim a path keeps it.
+    Indexes& ix = *index;
     for (PendingPath const& p : pending) {
-        std::string& cached = idMap[p.node->getNodeId()].path;
-        if (cached.empty())
-            cached = p.path;
-        auto const added = nodePathMap.emplace(p.path, p.node);
-        if (added.second)
-            pathsOfNode.emplace(p.node, &added.first->first);
+        std::uint32_t const r = ix.record(p.path);
+        unsigned int const id = p.node->getNodeId();
+        Indexes::IdSlot* const cached = ix.id(id);
+        if (!cached || cached->path == kNoPath) {
+            if (cached)
+                cached->path = r;
+            else
+                ix.ids.insert(Indexes::IdSlot{id, r, nullptr});
+            ++ix.records[r].caches;
+        }
+        Indexes::PathRecord& claimed = ix.records[r];
+        if (!claimed.owner) {
+            claimed.owner = p.node;
+            ix.pathsOfNode.emplace(p.node, r);
+        }
     }
 }
 
@@ -418,7 +593,7 @@ std::string NodeStore::walkPath(Node* node, std::vector<PendingPath>* pending) c
         // Registered nodes always have a cached path, so the walk cannot
         // loop; this bound only guards against a store corrupted by a
         // plug-in that changed ids of registered nodes.
-        if (chain.size() > idMap.size())
+        if (chain.size() > index->ids.size())
             break;
         current = parent;
         chain.push_back(current);

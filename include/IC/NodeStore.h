@@ -23,9 +23,8 @@
 #include <IC/Node.h>
 #include <cstddef>
 #include <cstdint>
-#include <map>
+#include <memory>
 #include <mutex>
-#include <unordered_map>
 #include <string>
 #include <utility>
 #include <vector>
@@ -120,19 +119,13 @@ public:
     std::string nodecode(TopoVec topovec) const;
 
 private:
-    // What the store knows under one node id: the registered node (the
-    // id index) and the cached path (the path cache). Either may be absent:
-    // a path is cached for every node whose path was computed, registered
-    // or not. A computed path is never empty.
-    struct IdEntry {
-        Node* node = nullptr;
-        std::string path;
-    };
     // A path computed for a node of the walk, not yet cached.
     struct PendingPath {
         Node* node;
         std::string path;
     };
+    // The indexes, defined with the store's code.
+    struct Indexes;
 
     // The path of node, computed as calcNodePath does; the paths it would
     // cache go to pending (topmost first) when pending is not null.
@@ -149,38 +142,7 @@ private:
     // Removes the node's first entry from the getMap list of its type.
     void unlist(Node* node);
 
-    // The nodes of one sensor type in order of addition. A removed node
-    // leaves a hole until holes outnumber nodes; positions finds a node's
-    // places without a search.
-    struct TypeList {
-        std::vector<Node*> nodes;
-        std::unordered_multimap<Node*, std::size_t> positions;
-    };
-
-    // Hashes a path a byte at a time. A look-up's path is a copy its caller
-    // has just written (getNode takes it by value); reading those bytes in
-    // wider words than they were written in cannot be served from the
-    // pending writes, which holds each look-up back until the previous one
-    // has finished its memory accesses.
-    struct PathHash {
-        std::size_t operator()(std::string const& path) const noexcept
-        {
-            std::uint64_t h = 14695981039346656037ull; // FNV-1a
-            for (char c : path)
-                h = (h ^ static_cast<unsigned char>(c)) * 1099511628211ull;
-            return static_cast<std::size_t>(h);
-        }
-    };
-
-    // By sensor type (ascending): what getMap lists.
-    std::map<Node::SensorType, TypeList> sensorMap;
-    // The id index and the path cache, by node id.
-    std::unordered_map<unsigned int, IdEntry> idMap;
-    // Node by path; the first node to claim a path keeps it.
-    std::unordered_map<std::string, Node*, PathHash> nodePathMap;
-    // The keys of nodePathMap that lead to each node, so that removing a
-    // node needs no walk of nodePathMap.
-    std::unordered_multimap<Node*, std::string const*> pathsOfNode;
+    std::unique_ptr<Indexes> const index;
     // Re-entrant: path computations look nodes up under the lock they hold.
     mutable std::recursive_mutex storeLock;
 };
