@@ -230,24 +230,11 @@ TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAndStablePaths)
         EXPECT_EQ(after[description], path) << description;
 }
 
-TEST_F(LinuxHwTest, ThermalZonesStandInWhenThereIsNoHwmon)
-{
-    useTree("small");
-    fs::remove_all(root() + "/sys/class/hwmon");
-    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast"); // not a number: the default interval
-    open();
-    std::vector<std::string> temps;
-    for (Node* n : nodes())
-        if (n->getSensor() == Node::TemperatureSensor)
-            temps.push_back(ic_->getNodeHierarchy(n) + " " + n->getDescription());
-    EXPECT_EQ(temps, std::vector<std::string>{"ROOT:00000000->Chassis:00000000->Temperature Sensor:00000000 Thermal zone 0 (x86_pkg_temp)"});
-    EXPECT_EQ(prop("Thermal zone 0 (x86_pkg_temp)", "reading"), "45.0 C");
-}
-
 // ------------------------------------------------------------------ alerts
 
-TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChange)
+TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChangeAndOddFilesAreUnknown)
 {
+    ictest::LogCapture log;
     open("small");
     std::string const pkg = pathOf(kPackage);
     std::string const warning = "5/2/1/CPU 0 Package id 0 temperature 100.0 C above warning 80.0 C";
@@ -272,6 +259,26 @@ TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChange)
     // raised nothing.
     write("sys/class/hwmon/hwmon0/temp4_max", "0");
     EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "upper_warning") == "<none>"; }));
+
+    // Odd files make a value unknown and are logged once, not on every poll;
+    // good values come back without an alert.
+    auto logged = [&](std::string const& file) {
+        std::size_t n = 0;
+        for (HGLog::Record const& r : log.logs("Helmgard.Plugins.LinuxHW"))
+            n += r.message.find(file) != std::string::npos;
+        return n;
+    };
+    write("sys/class/hwmon/hwmon0/temp2_input", "hot!");
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "state") == "unknown"; }));
+    // A directory where a file should be cannot be read, by root either.
+    std::string const odd = root() + "/sys/class/hwmon/hwmon0/temp4_input";
+    fs::remove(odd);
+    fs::create_directory(odd);
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "reading") == "unknown"; }));
+    write("sys/class/hwmon/hwmon0/temp2_input", "43000");
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "reading") == "43.0 C"; }));
+    EXPECT_EQ(logged("temp2_input"), 1u);
+    EXPECT_EQ(logged("temp4_input"), 1u);
     EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
     EXPECT_TRUE(alerts(pathOf("CPU 0 Core 2 temperature")).empty());
 }
@@ -342,31 +349,6 @@ TEST_F(LinuxHwTest, DevicesArriveLeaveAndComeBackUnderTheirPath)
 
 // ------------------------------------------------------------------ bad input
 
-TEST_F(LinuxHwTest, OddFilesAreUnknownAndLoggedOnce)
-{
-    ictest::LogCapture log;
-    open("small");
-    auto logged = [&](std::string const& file) {
-        std::size_t n = 0;
-        for (HGLog::Record const& r : log.logs("Helmgard.Plugins.LinuxHW"))
-            n += r.message.find(file) != std::string::npos;
-        return n;
-    };
-    write("sys/class/hwmon/hwmon0/temp2_input", "hot!");
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "state") == "unknown"; }));
-    // A directory where a file should be cannot be read, by root either.
-    std::string const odd = root() + "/sys/class/hwmon/hwmon0/temp4_input";
-    fs::remove(odd);
-    fs::create_directory(odd);
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "reading") == "unknown"; }));
-    // Logged once, not on every poll; good values come back without an alert.
-    write("sys/class/hwmon/hwmon0/temp2_input", "43000");
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "reading") == "43.0 C"; }));
-    EXPECT_EQ(logged("temp2_input"), 1u);
-    EXPECT_EQ(logged("temp4_input"), 1u);
-    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
-}
-
 TEST_F(LinuxHwTest, HostileNumbersAreUnknownAndNeverCrash)
 {
     using namespace std::string_literals;
@@ -429,39 +411,41 @@ TEST_F(LinuxHwTest, HostileNumbersAreUnknownAndNeverCrash)
     EXPECT_TRUE(eventually([&] { return prop("hostile temp3 temperature", "reading") == "-6.0 C"; }));
 }
 
-TEST_F(LinuxHwTest, MissingRootAndOddIntervalStillLoad)
+// Without hwmon, thermal zones stand in. Unloading must wake the poller that
+// waits for its interval, and the nodes' code leaves with the plug-in: the
+// library forgets every node. Without any tree, the host, its chassis and its
+// memory are still there, whatever the interval says.
+TEST_F(LinuxHwTest, ThermalZonesStandInAndUnloadingForgetsEveryNode)
 {
+    useTree("small");
+    fs::remove_all(root() + "/sys/class/hwmon");
     {
         ictest::EnvGuard slow("IC_LINUXHW_POLL_MS", "600000");
         open();
     }
+    std::vector<std::string> temps;
+    for (Node* n : nodes())
+        if (n->getSensor() == Node::TemperatureSensor)
+            temps.push_back(ic_->getNodeHierarchy(n) + " " + n->getDescription());
+    EXPECT_EQ(temps, std::vector<std::string>{"ROOT:00000000->Chassis:00000000->Temperature Sensor:00000000 Thermal zone 0 (x86_pkg_temp)"});
+    EXPECT_EQ(prop("Thermal zone 0 (x86_pkg_temp)", "reading"), "45.0 C");
+    {
+        ictest::Watchdog guard(30, "unloading while the polling thread waits");
+        close();
+    }
+    std::vector<Node*> left;
+    IC::InstCtrl::nodestore.getAllNodes(left);
+    EXPECT_TRUE(left.empty());
+
+    fs::remove_all(root());
+    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast"); // not a number: the default interval
+    open();
     std::vector<std::string> types;
     for (Node* n : nodes())
         types.push_back(ic_->getNodeHierarchy(n));
     std::sort(types.begin(), types.end());
     EXPECT_EQ(types, (std::vector<std::string>{"ROOT:00000000", "ROOT:00000000->Chassis:00000000",
                                                "ROOT:00000000->Chassis:00000000->RAM:00000000"}));
-    {
-        // The polling thread waits for its interval; unloading must wake it.
-        ictest::Watchdog guard(30, "unloading while the polling thread waits");
-        close();
-    }
-}
-
-// ------------------------------------------------------------------ lifecycle
-
-TEST_F(LinuxHwTest, UnloadingOnThisMachineMakesTheLibraryForgetEveryNode)
-{
-    // The nodes' code leaves with the plug-in: no pointer may stay behind.
-    ictest::EnvGuard real("IC_SYSFS_ROOT", "/");
-    IC::Error* err = nullptr;
-    ASSERT_EQ(Open(&ic_, &err), 0);
-    ASSERT_GE(nodes().size(), 4u); // ROOT, chassis, a CPU, the memory at least
-    std::this_thread::sleep_for(std::chrono::milliseconds(200)); // a few polls of the real tree
-    close();
-    std::vector<Node*> left;
-    IC::InstCtrl::nodestore.getAllNodes(left);
-    EXPECT_TRUE(left.empty());
 }
 
 } // namespace
