@@ -81,16 +81,6 @@ void simpleB(unsigned int code, SD::DateTime time, std::string path, void const*
     simpleA(code + 100, time, path, ctx);
 }
 
-bool registerlockFreeForOthers()
-{
-    bool free = false;
-    ictest::JoinedThread([&free] {
-        if ((free = ICC::registerlock.try_lock()))
-            ICC::registerlock.unlock();
-    }).join();
-    return free;
-}
-
 int c1 = 1, c2 = 2, c3 = 3, c4 = 4, c5 = 5, c6 = 6;
 
 // ROOT <- CPU 0, CPU 1, CPU 2, Fan 0 in the library's node store.
@@ -188,7 +178,7 @@ TEST_F(Dispatch, AssertsAreOnlyRecordedAndCallbacksRunWithoutTheLockSoThatTheyMa
     EXPECT_EQ(asserted().size(), 2u);
     bool lockFree = false;
     gHook = [&](void const* ctx) {
-        lockFree = registerlockFreeForOthers();
+        lockFree = lockableFromAnotherThread(ICC::registerlock);
         expectError(ic.deRegisterForAlerts(recA, ST::CPU, ctx), 0);
         expectError(ic.registerForAlerts(recB, ST::CPU, &c3), 0);
     };
@@ -269,7 +259,7 @@ TEST_F(SimpleAlerts, OneCallPerPathWithTheClassesCodeUnderTheLockAndTheirOwnAfte
     ic.registerForSimpleAlerts(simpleB, 4, &c2);
     ic.registerForSimpleAlerts(simpleA, 20, &c3);
     bool freeForOthers = false;
-    gSimpleHook = [&] { freeForOthers = freeForOthers || registerlockFreeForOthers(); };
+    gSimpleHook = [&] { freeForOthers = freeForOthers || lockableFromAnotherThread(ICC::registerlock); };
     ICC::AlertCallBackFP({alert(5, {P0, PF}), alert(3, {P0}), alert(4, {P1}), alert(0, {P2})});
     EXPECT_FALSE(freeForOthers);
     // By subscriber, each in batch order; removals are not passed on.

@@ -123,8 +123,12 @@ std::string const kPackage = "CPU 0 Package id 0 temperature";
 
 // ------------------------------------------------------------------ the tree
 
-TEST_F(LinuxHwTest, SmallTreeLayoutAndProperties)
+// The small tree: its layout and properties; readings and alarms raise one
+// alert per change, odd files make a value unknown; devices arrive, leave and
+// come back under their path.
+TEST_F(LinuxHwTest, SmallTreeLayoutAlertsAndDevices)
 {
+    ictest::LogCapture log;
     open("small");
     std::string const chassis = "ROOT:00000000->Chassis:00000000";
     std::string const cpu = chassis + "->CPU:00000000";
@@ -170,72 +174,7 @@ TEST_F(LinuxHwTest, SmallTreeLayoutAndProperties)
     };
     for (auto const& p : props)
         EXPECT_EQ(prop(p[0], p[1]), p[2]) << p[0];
-}
 
-TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAndStablePaths)
-{
-    open("large");
-    std::map<Node::SensorType, std::size_t> counts;
-    for (Node* n : nodes())
-        ++counts[n->getSensor()];
-    EXPECT_EQ(counts, (std::map<Node::SensorType, std::size_t>{
-                          {Node::ROOT, 1}, {Node::Chassis, 1}, {Node::BIOS, 1}, {Node::CPU, 2},
-                          {Node::CPUCore, 16}, {Node::RAM, 1}, {Node::DIMM, 8}, {Node::NetworkPort, 4},
-                          {Node::HardDrive, 4}, {Node::PowerSupply, 2}, {Node::TemperatureSensor, 21},
-                          {Node::Fan, 6}, {Node::VoltageSensor, 9}}));
-    // Core ids with gaps; coretemp sensors below their package by input
-    // index; DIMMs by mc << 8 | dimm; board sensors by chip digest << 8 | index.
-    std::string const chassis = "ROOT:00000000->Chassis:00000000->";
-    std::pair<char const*, std::string> const places[] = {
-        {"CPU 1 core 11", chassis + "CPU:00000001->CPU Core:0000000b"},
-        {"CPU 1 Core 11 temperature", chassis + "CPU:00000001->Temperature Sensor:0000000d"},
-        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", chassis + "RAM:00000000->DIMM:00000102"},
-        {"nct6779 fan1 speed", chassis + "Fan:"},
-    };
-    for (auto const& [description, hierarchy] : places)
-        EXPECT_EQ(ic_->getNodeHierarchy(node(pathOf(description))).substr(0, hierarchy.size()), hierarchy);
-    std::string const fan = ic_->getNodeHierarchy(node(pathOf("nct6779 fan1 speed")));
-    EXPECT_EQ(fan.substr(fan.size() - 2), "01") << fan;
-    std::string const props[][3] = {
-        {"CPU 1 core 11", "threads", "15,31"},
-        {"nct6779 fan1 speed", "reading", "5400 RPM"},
-        {"nct6779 in1 voltage", "reading", "12.096 V"},
-        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", "corrected_errors", "2"},
-        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", "state", "warning"},
-        {"Power supply PSU1 (Mains)", "reading", "184.0 W"},
-        {"Network port ens1f0 (0c:42:a1:7e:20:00)", "speed", "25000 Mb/s"},
-    };
-    for (auto const& p : props)
-        EXPECT_EQ(prop(p[0], p[1]), p[2]) << p[0];
-
-    // Paths survive a reopen, hwmon renumbering and a new device.
-    auto byDescription = [this] {
-        std::map<std::string, std::string> out;
-        for (Node* n : nodes())
-            out[n->getDescription()] = n->getPath();
-        return out;
-    };
-    std::map<std::string, std::string> const before = byDescription();
-    close();
-    // The kernel numbers hwmon chips in driver load order, and another card
-    // may come with the next boot: neither moves the others.
-    fs::rename(root() + "/sys/class/hwmon/hwmon0", root() + "/sys/class/hwmon/hwmon7");
-    fs::rename(root() + "/sys/class/hwmon/hwmon2", root() + "/sys/class/hwmon/hwmon0");
-    install("sys/class/net/eno3", {{"device/uevent", "PCI_SLOT_NAME=0000:19:00.2"},
-                                   {"address", "b4:96:91:4a:10:03"}, {"carrier", "1"}});
-    open();
-    std::map<std::string, std::string> after = byDescription();
-    EXPECT_EQ(after.size(), before.size() + 1);
-    for (auto const& [description, path] : before)
-        EXPECT_EQ(after[description], path) << description;
-}
-
-// ------------------------------------------------------------------ alerts
-
-TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChangeAndOddFilesAreUnknown)
-{
-    ictest::LogCapture log;
-    open("small");
     std::string const pkg = pathOf(kPackage);
     std::string const warning = "5/2/1/CPU 0 Package id 0 temperature 100.0 C above warning 80.0 C";
     // At the critical limit is not above it.
@@ -281,11 +220,72 @@ TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChangeAndOddFilesAreUnknown
     EXPECT_EQ(logged("temp4_input"), 1u);
     EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
     EXPECT_TRUE(alerts(pathOf("CPU 0 Core 2 temperature")).empty());
+
+    // A new port, gone again, back again; a disk that goes.
+    std::size_t const before = nodes().size();
+    std::map<std::string, std::string> const eth9 = {
+        {"device/uevent", "PCI_SLOT_NAME=0000:03:00.0"}, {"address", "00:1b:21:aa:bb:cc"}, {"carrier", "1"},
+        {"speed", "10000"}};
+    install("sys/class/net/eth9", eth9);
+    std::string const description = "Network port eth9 (00:1b:21:aa:bb:cc)";
+    ASSERT_TRUE(eventually([&] { return nodes().size() == before + 1; }));
+    std::string const path = pathOf(description);
+    EXPECT_EQ(ic_->getNodeHierarchy(node(path)).rfind("ROOT:00000000->Chassis:00000000->Network Port:", 0), 0u);
+    EXPECT_EQ(prop(description, "speed"), "10000 Mb/s");
+    std::string const arrival = "3/1/0/" + description;
+    std::string const removal = "4/1/1/" + description + " was removed";
+    expectAlerts(path, {arrival});
+    fs::remove_all(root() + "/sys/class/net/eth9");
+    expectAlerts(path, {arrival, removal});
+    EXPECT_TRUE(eventually([&] { return node(path) == nullptr && nodes().size() == before; }));
+    // It comes back under the same path.
+    install("sys/class/net/eth9", eth9);
+    expectAlerts(path, {arrival, removal, arrival});
+
+    std::string const diskPath = pathOf(disk);
+    fs::remove_all(root() + "/sys/block/nvme0n1");
+    expectAlerts(diskPath, {"4/1/1/" + disk + " was removed"});
+    EXPECT_TRUE(eventually([&] { return node(diskPath) == nullptr; }));
 }
 
-TEST_F(LinuxHwTest, FansSuppliesMemoryAndLinksRaiseTheirClasses)
+// The large tree: instances, units and the alert classes of fans, supplies,
+// memory and links; paths survive a reopen.
+TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAlertsAndStablePaths)
 {
     open("large");
+    std::map<Node::SensorType, std::size_t> counts;
+    for (Node* n : nodes())
+        ++counts[n->getSensor()];
+    EXPECT_EQ(counts, (std::map<Node::SensorType, std::size_t>{
+                          {Node::ROOT, 1}, {Node::Chassis, 1}, {Node::BIOS, 1}, {Node::CPU, 2},
+                          {Node::CPUCore, 16}, {Node::RAM, 1}, {Node::DIMM, 8}, {Node::NetworkPort, 4},
+                          {Node::HardDrive, 4}, {Node::PowerSupply, 2}, {Node::TemperatureSensor, 21},
+                          {Node::Fan, 6}, {Node::VoltageSensor, 9}}));
+    // Core ids with gaps; coretemp sensors below their package by input
+    // index; DIMMs by mc << 8 | dimm; board sensors by chip digest << 8 | index.
+    std::string const chassis = "ROOT:00000000->Chassis:00000000->";
+    std::pair<char const*, std::string> const places[] = {
+        {"CPU 1 core 11", chassis + "CPU:00000001->CPU Core:0000000b"},
+        {"CPU 1 Core 11 temperature", chassis + "CPU:00000001->Temperature Sensor:0000000d"},
+        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", chassis + "RAM:00000000->DIMM:00000102"},
+        {"nct6779 fan1 speed", chassis + "Fan:"},
+    };
+    for (auto const& [description, hierarchy] : places)
+        EXPECT_EQ(ic_->getNodeHierarchy(node(pathOf(description))).substr(0, hierarchy.size()), hierarchy);
+    std::string const fan = ic_->getNodeHierarchy(node(pathOf("nct6779 fan1 speed")));
+    EXPECT_EQ(fan.substr(fan.size() - 2), "01") << fan;
+    std::string const props[][3] = {
+        {"CPU 1 core 11", "threads", "15,31"},
+        {"nct6779 fan1 speed", "reading", "5400 RPM"},
+        {"nct6779 in1 voltage", "reading", "12.096 V"},
+        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", "corrected_errors", "2"},
+        {"DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0", "state", "warning"},
+        {"Power supply PSU1 (Mains)", "reading", "184.0 W"},
+        {"Network port ens1f0 (0c:42:a1:7e:20:00)", "speed", "25000 Mb/s"},
+    };
+    for (auto const& p : props)
+        EXPECT_EQ(prop(p[0], p[1]), p[2]) << p[0];
+
     std::string const psu = "Power supply PSU2 (Mains)";
     std::string const dimm = "DIMM CPU_SrcID#0_MC#0_Chan#1_DIMM#0";
     std::string const port = "Network port eno1 (b4:96:91:4a:10:01)";
@@ -316,35 +316,27 @@ TEST_F(LinuxHwTest, FansSuppliesMemoryAndLinksRaiseTheirClasses)
     for (char const* quiet : {"Network port eno2 (b4:96:91:4a:10:02)", "DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0",
                               "nct6779 fan6 speed"})
         EXPECT_TRUE(alerts(pathOf(quiet)).empty()) << quiet;
-}
 
-TEST_F(LinuxHwTest, DevicesArriveLeaveAndComeBackUnderTheirPath)
-{
-    open("small");
-    std::size_t const before = nodes().size();
-    std::map<std::string, std::string> const eth9 = {
-        {"device/uevent", "PCI_SLOT_NAME=0000:03:00.0"}, {"address", "00:1b:21:aa:bb:cc"}, {"carrier", "1"},
-        {"speed", "10000"}};
-    install("sys/class/net/eth9", eth9);
-    std::string const description = "Network port eth9 (00:1b:21:aa:bb:cc)";
-    ASSERT_TRUE(eventually([&] { return nodes().size() == before + 1; }));
-    std::string const path = pathOf(description);
-    EXPECT_EQ(ic_->getNodeHierarchy(node(path)).rfind("ROOT:00000000->Chassis:00000000->Network Port:", 0), 0u);
-    EXPECT_EQ(prop(description, "speed"), "10000 Mb/s");
-    std::string const arrival = "3/1/0/" + description;
-    std::string const removal = "4/1/1/" + description + " was removed";
-    expectAlerts(path, {arrival});
-    fs::remove_all(root() + "/sys/class/net/eth9");
-    expectAlerts(path, {arrival, removal});
-    EXPECT_TRUE(eventually([&] { return node(path) == nullptr && nodes().size() == before; }));
-    // It comes back under the same path.
-    install("sys/class/net/eth9", eth9);
-    expectAlerts(path, {arrival, removal, arrival});
-
-    std::string const disk = pathOf("Disk nvme0n1: Samsung SSD 980 PRO 1TB (1000 GB)");
-    fs::remove_all(root() + "/sys/block/nvme0n1");
-    expectAlerts(disk, {"4/1/1/Disk nvme0n1: Samsung SSD 980 PRO 1TB (1000 GB) was removed"});
-    EXPECT_TRUE(eventually([&] { return node(disk) == nullptr; }));
+    // Paths survive a reopen, hwmon renumbering and a new device.
+    auto byDescription = [this] {
+        std::map<std::string, std::string> out;
+        for (Node* n : nodes())
+            out[n->getDescription()] = n->getPath();
+        return out;
+    };
+    std::map<std::string, std::string> const before = byDescription();
+    close();
+    // The kernel numbers hwmon chips in driver load order, and another card
+    // may come with the next boot: neither moves the others.
+    fs::rename(root() + "/sys/class/hwmon/hwmon0", root() + "/sys/class/hwmon/hwmon7");
+    fs::rename(root() + "/sys/class/hwmon/hwmon2", root() + "/sys/class/hwmon/hwmon0");
+    install("sys/class/net/eno3", {{"device/uevent", "PCI_SLOT_NAME=0000:19:00.2"},
+                                   {"address", "b4:96:91:4a:10:03"}, {"carrier", "1"}});
+    open();
+    std::map<std::string, std::string> after = byDescription();
+    EXPECT_EQ(after.size(), before.size() + 1);
+    for (auto const& [description, path] : before)
+        EXPECT_EQ(after[description], path) << description;
 }
 
 // ------------------------------------------------------------------ bad input

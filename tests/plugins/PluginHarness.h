@@ -67,7 +67,6 @@ inline std::string const kLogIC = "Helmgard.IC.InstrumentationControl";
 inline std::string const kLogMI = kLogIC + ".MIControl";
 inline std::string const kLogFP = kLogIC + ".FPControl";
 inline std::string const kLogLT = kLogIC + ".LoaderThread";
-inline std::string const kLogLC = "Helmgard.IC.LoadControl";
 inline std::string const kLogPlugin = "ictest.plugin";
 
 struct Harness {

@@ -173,6 +173,18 @@ struct JoinedThread : std::thread {
     }
 };
 
+// True when another thread can take the lock m (an SD::Mutex) right now.
+template <class Lock>
+bool lockableFromAnotherThread(Lock& m)
+{
+    bool taken = false;
+    JoinedThread([&] {
+        if ((taken = m.try_lock()))
+            m.unlock();
+    }).join();
+    return taken;
+}
+
 // A file's bytes; the standard output of a shell command; a text's lines.
 inline std::string slurp(std::filesystem::path const& file)
 {
