@@ -160,6 +160,17 @@ void exercise(Paths const& paths, void const* context, std::size_t minNodes)
     }
 }
 
+// The paths of the functional plug-ins' supplies.
+Paths supplyPaths()
+{
+    std::vector<Node*> supplies;
+    facade->getMap(supplies, Node::PowerSupply);
+    Paths paths;
+    for (Node* n : supplies)
+        paths.push_back(facade->getNodeUniqueId(n));
+    return paths;
+}
+
 // The client's callback, on the plug-ins' threads: the whole facade, then
 // itself deregistered and registered again (other threads do the same, so
 // either may find the other's work done).
@@ -207,13 +218,8 @@ TEST(Stress, OpenUnloadCyclesWithAReenteringClientReturnToTheBaseline)
         ASSERT_EQ(Open(&facade, &error), 0) << "cycle " << cycle;
         unsigned long const before = findings.runs;
         ASSERT_EQ(facade->registerForAlerts(reenter, Node::PowerSupply, &context).getStatus(), 0);
-        std::vector<Node*> supplies;
-        facade->getMap(supplies, Node::PowerSupply);
-        Paths paths;
-        for (Node* n : supplies)
-            paths.push_back(facade->getNodeUniqueId(n));
         // Ten interfaces of six nodes, ten functional plug-ins of two.
-        exercise(paths, &mainTag, 80);
+        exercise(supplyPaths(), &mainTag, 80);
         ASSERT_TRUE(ictest::eventually([&] { return findings.runs > before; })) << "no alert reached the client, cycle " << cycle;
         fpAlertsSeen = fpAlertsSeen || fpReceived() > 0;
         Unloadlib(); // while the callbacks are busy
@@ -302,14 +308,8 @@ TEST(Stress, ReloadsAlertsQueriesAndRegistrationsTogether)
     for (int q = 0; q < 3; ++q)
         workers.emplace_back([&] {
             thread_local char tag;
-            for (; !stop; ++queries, std::this_thread::sleep_for(std::chrono::milliseconds(2))) {
-                std::vector<Node*> supplies;
-                ic->getMap(supplies, Node::PowerSupply);
-                Paths paths;
-                for (Node* n : supplies)
-                    paths.push_back(ic->getNodeUniqueId(n));
-                exercise(paths, &tag, 0);
-            }
+            for (; !stop; ++queries, std::this_thread::sleep_for(std::chrono::milliseconds(2)))
+                exercise(supplyPaths(), &tag, 0);
         });
     std::this_thread::sleep_for(std::chrono::seconds(6));
     stop = true;
