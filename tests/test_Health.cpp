@@ -116,7 +116,7 @@ protected:
 
 // ---------------------------------------------------------------- relaying
 
-TEST_F(HealthTest, RelaysOnceAndTheAssertedStoreFollowsTheStatus)
+TEST_F(HealthTest, RelaysOnceTheAssertedStoreFollowsTheStatusAndAReloadedPlugInTakesOver)
 {
     open();
     void const* temps = watch(Node::TemperatureSensor);
@@ -143,6 +143,23 @@ TEST_F(HealthTest, RelaysOnceAndTheAssertedStoreFollowsTheStatus)
     EXPECT_EQ(got(removals),
               std::vector<std::string>{ictest::sig(Alert(1, Alert::NodeRemoval, {fan_}, 2, "fan removed"))});
     EXPECT_TRUE(asserted().empty());
+
+    // Released, it relays nothing any more (a registration left behind would
+    // call into the unloaded image).
+    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hot");
+    fs::remove(fp_ / "health.so");
+    IC::InstCtrl::TimedReload();
+    std::size_t const relayed = got(temps).size();
+    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hotter");
+    EXPECT_EQ(got(temps).size(), relayed);
+    // The new instance clears the roll-up the old one raised.
+    addHealth();
+    IC::InstCtrl::TimedReload();
+    void const* rollups = watch(shipped::kHealthRollup);
+    raise(Node::TemperatureSensor, 0, 0, shipped::kThreshold, 1, "normal");
+    EXPECT_TRUE(asserted().empty());
+    EXPECT_EQ(got(rollups), std::vector<std::string>{ictest::sig(Alert(0, shipped::kHealthRollup, {chassis_}, 1,
+                                                                       "health: all clear, no asserted alerts"))});
 }
 
 // ---------------------------------------------------------------- roll-up
@@ -221,27 +238,6 @@ TEST_F(HealthTest, WhatARemovedInterfaceAssertedIsWithdrawn)
     ASSERT_EQ(IC::InstCtrl::myfps.size(), 1u);
     EXPECT_EQ(IC::InstCtrl::myfps[0]->updatedMis({}, {gone}).getStatus(), 0);
     EXPECT_EQ(asserted(), (std::map<std::string, std::string>{{fan_, "5/2/first fan slow"}, {chassis_, "8/2/"}}));
-}
-
-TEST_F(HealthTest, ReleaseDeregistersAndAReloadedPlugInTakesOver)
-{
-    open();
-    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hot");
-    void const* temps = watch(Node::TemperatureSensor);
-    fs::remove(fp_ / "health.so");
-    IC::InstCtrl::TimedReload();
-    // Nothing relays any more (a registration left behind would call into
-    // the unloaded image).
-    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hotter");
-    EXPECT_TRUE(got(temps).empty());
-    // The new instance clears the roll-up the old one raised.
-    addHealth();
-    IC::InstCtrl::TimedReload();
-    void const* rollups = watch(shipped::kHealthRollup);
-    raise(Node::TemperatureSensor, 0, 0, shipped::kThreshold, 1, "normal");
-    EXPECT_TRUE(asserted().empty());
-    EXPECT_EQ(got(rollups), std::vector<std::string>{ictest::sig(Alert(0, shipped::kHealthRollup, {chassis_}, 1,
-                                                                       "health: all clear, no asserted alerts"))});
 }
 
 // ------------------------------------------------ with the Linux interface
