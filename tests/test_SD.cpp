@@ -207,11 +207,10 @@ TEST(SDDirectoryReader, ListsEntriesOfEveryTypeEndingWithTheSuffixSortedByteWise
     EXPECT_EQ(names(r), want);
     for (int bad : {7, -1, INT_MAX, INT_MIN})
         EXPECT_EQ(r.getFileName(bad), nullptr) << bad;
-    // An empty or null suffix lists everything but the dot entries; a
-    // trailing separator still gets one more.
+    // An empty or null suffix lists everything but the dot entries. (A
+    // trailing separator is the plug-in discovery test's.)
     EXPECT_EQ(names(SD::DirectoryReader(d.root().c_str(), "")).size(), 12u);
     EXPECT_EQ(names(SD::DirectoryReader(d.root().c_str(), nullptr)).size(), 12u);
-    EXPECT_EQ(names(SD::DirectoryReader((d.root() + "/").c_str(), "so.1")), Names{d.root() + "//b.so.1"});
     for (char const* none : {"/nothing-here", "/a.so"})
         EXPECT_EQ(SD::DirectoryReader((d.root() + none).c_str(), "").getNumberOfFiles(), 0) << none;
     EXPECT_EQ(SD::DirectoryReader(nullptr, ".so").getFileName(0), nullptr);
