@@ -190,7 +190,7 @@ TEST_F(Loaders, EveryWayToFailIsLoggedUnloadedAndCounted)
                        {"mi_throwinit", "myloadMIs: Exception init" + thrown + " for {path}"},
                        {"fp_nullobject", "myloadFPs: {path} OpenFP pointer is NULL"},
                        {"fp_throwint", "myloadFPs Caught exception for {path}"},
-                       {"mi_code", ""}, {"mi_nullerror", ""}, {"mi_nullobject", ""}, {"mi_throwopen", ""},
+                       {"mi_code", ""}, {"mi_nullerror", ""}, {"mi_nullobject", ""},
                        {"mi_throwint", ""}, {"fp_noentry", ""}, {"fp_code", ""}, {"fp_nullerror", ""},
                        {"fp_errstatus", ""}, {"fp_initfails", ""}, {"fp_throwinit", ""}};
     for (auto const& c : cases) {

@@ -22,8 +22,8 @@ namespace ictest {
 
 enum Mode {
     MODE_GOOD, MODE_SLOW, MODE_NO_ENTRY, MODE_CODE, MODE_NULL_ERROR, MODE_ERROR_STATUS, MODE_NULL_OBJECT,
-    MODE_BROKEN, MODE_INIT_FAILS, MODE_REG_FAILS, MODE_GETMAP_FAILS, MODE_GETMAP_THROWS, MODE_THROW_OPEN,
-    MODE_THROW_INIT, MODE_THROW_INT, MODE_THROW_INT_OPEN,
+    MODE_INIT_FAILS, MODE_REG_FAILS, MODE_GETMAP_FAILS, MODE_GETMAP_THROWS, MODE_THROW_INIT,
+    MODE_THROW_INT, // throws an int from its entry point
     MODE_ANNOUNCE,    // announces its nodes through MapNewFPNode
     MODE_ACTIVE,      // announces, registers for its own supply, asserts an alert on it
     MODE_RELAY,       // re-raises what interfaces raise on CPUs and fans, through the harness

@@ -163,8 +163,6 @@ public:
         }
         if (Error const e = initFails(); e.getStatus() != 0)
             return e;
-        if (kMode == MODE_THROW_INT)
-            throw 42;
         std::lock_guard<std::mutex> g(m_);
         seen_->base = base_ = base;
         add(Node::ROOT, TP_INSTANCE, 0, "Fake server");
@@ -383,15 +381,8 @@ unsigned char open(char const* entry, Object** object, Error** err)
     say(entry);
     if (kMode == MODE_CODE)
         return 'X';
-    if (kMode == MODE_THROW_OPEN)
-        throw std::runtime_error("open exploded");
-    if (kMode == MODE_THROW_INT_OPEN)
+    if (kMode == MODE_THROW_INT)
         throw 42;
-    if (kMode == MODE_BROKEN) {
-        *object = nullptr;
-        *err = &bad;
-        return 1;
-    }
     if (kMode != MODE_NULL_OBJECT)
         *object = new Plugin;
     if (kMode != MODE_NULL_ERROR)
