@@ -256,7 +256,7 @@ TEST_F(PluginTrust, InAScanEachFileIsJudgedOnItsOwnAndEachDirectoryOnce)
 {
     ASSERT_NO_FATAL_FAILURE(build("dir mi 0755; dir open 0777; dir fp 0755; copy trust_probe mi/a.so;"
                                   "copy trust_probe mi/b.so; copy trust_probe mi/w.so 0666; fifo mi/pipe.so;"
-                                  "copy trust_other o.so; link {root}/o.so mi/link.so; copy trust_probe open/c.so;"
+                                  "copy trust_other o.so; link {root}/o.so mi/link.so; copy trust_other open/a.so;"
                                   "copy trust_other fp/f.so"));
     {
         SD::PlatformUtilities::Scan const outer;
@@ -264,7 +264,7 @@ TEST_F(PluginTrust, InAScanEachFileIsJudgedOnItsOwnAndEachDirectoryOnce)
         expectRefused(path("mi/w.so"), "is writable by group or others (mode 0666)");
         expectRefused(path("mi/pipe.so"), "not a regular file");
         expectRefused(path("mi/missing.so"), "No such file or directory");
-        expectRefused(path("open/c.so"), "directory " + path("open") + " is writable");
+        expectRefused(path("open/a.so"), "directory " + path("open") + " is writable");
         expectRefused(path("mi/.."), "not a regular file");
         expectAccepted(path("mi/link.so"), "trust_other");
         {
