@@ -35,6 +35,7 @@ TEST(LoaderThreadAlone, AZeroDelayBecomesTenSecondsAndAStopWhileWaitingEndsIt)
 // ends run(). (The periodic calls are the installed loader's tests.)
 TEST(LoaderThreadAlone, AStoppedOneNeverCallsAndAnExceptionEndsRun)
 {
+    ictest::Watchdog dog(30, "loader thread");
     calls = 0;
     IC::LoaderThread stopped(1, 0, &count);
     stopped.stop();
