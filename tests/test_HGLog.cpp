@@ -93,23 +93,4 @@ TEST(HGLoggerDeathTest, EnvironmentNamesTheConfigurationAtStartUp)
     EXPECT_EQ(readFile(dir + "/env.txt"), "Test.Env|INFO|from the environment\n");
 }
 
-TEST(HGLogger, ConcurrentLoggingAndListenerChanges)
-{
-    std::atomic<bool> stop{false};
-    std::vector<ictest::JoinedThread> loggers;
-    for (int t = 0; t < 4; ++t)
-        loggers.emplace_back([&stop, t] {
-            while (!stop.load())
-                HGLog::logEvent("f", "S", t, "Test.Threads", 3000, "thread ", t);
-        });
-    for (int i = 0; i < 200; ++i)
-        HGLogger::setListener(i % 2 ? HGLog::Listener() : [](HGLog::Record const&) {});
-    ictest::LogCapture cap;
-    EXPECT_TRUE(ictest::eventually([&] { return cap.records().size() >= 8; }));
-    stop = true;
-    loggers.clear();
-    for (auto const& r : cap.records())
-        EXPECT_EQ(r.message, "thread " + std::to_string(r.line));
-}
-
 } // namespace
