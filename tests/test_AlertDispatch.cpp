@@ -195,8 +195,8 @@ TEST_F(Dispatch, AssertsAreOnlyRecordedAndCallbacksRunWithoutTheLockSoThatTheyMa
 
 TEST_F(Registration, EntryPointsLogTheirArgumentsOnceAndTheOtherFormsAreSilent)
 {
-    std::string const a = " Callback=" + ictest::fnText(recA) + " *p=" + ictest::ptrText(&c1);
-    std::string const s = " Callback=" + ictest::fnText(simpleA), p = hex(P1) + " " + hex(P0) + " ";
+    std::string const a = " Callback=" + ptrText(reinterpret_cast<void const*>(recA)) + " *p=" + ptrText(&c1);
+    std::string const s = " Callback=" + ptrText(reinterpret_cast<void const*>(simpleA)), p = hex(P1) + " " + hex(P0) + " ";
     Paths const ps{P1, P0};
     std::pair<std::function<IC::Error()>, std::string> const rows[] = {
         {[&] { return ic.registerForAlerts(recA, ST::CPU, &c1); }, "registerForAlerts: sensor=4" + a},

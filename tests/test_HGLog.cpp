@@ -10,13 +10,6 @@ namespace {
 
 using HGLog::HGLogger;
 
-std::string readFile(std::string const& path)
-{
-    std::stringstream s;
-    s << std::ifstream(path).rdbuf();
-    return s.str();
-}
-
 // A file appender writing "%c|%p|%m" lines to file.
 std::string appender(std::string const& name, std::string const& file)
 {
@@ -74,8 +67,8 @@ TEST(HGLogger, ConfigurationSelectsLoggersAndTheTraceChannelSeparately)
     HGLog::logEvent("f", "S", 1, "Test.Cfg.C", 6000, "error of C");
     HGLogger::configureDefault(); // closes the files
     EXPECT_FALSE(HGLogger::isEnabled("Test.Cfg.A", 3000));
-    EXPECT_EQ(readFile(logOut), "Test.Cfg.A|INFO|progress of Test.Cfg.A\nTest.Cfg.C|ERROR|error of C\n");
-    EXPECT_EQ(readFile(traceOut), "HGTrace.Test.Cfg.B|INFO|progress of Test.Cfg.B\n");
+    EXPECT_EQ(ictest::slurp(logOut), "Test.Cfg.A|INFO|progress of Test.Cfg.A\nTest.Cfg.C|ERROR|error of C\n");
+    EXPECT_EQ(ictest::slurp(traceOut), "HGTrace.Test.Cfg.B|INFO|progress of Test.Cfg.B\n");
 }
 
 TEST(HGLoggerDeathTest, EnvironmentNamesTheConfigurationAtStartUp)
@@ -90,7 +83,7 @@ TEST(HGLoggerDeathTest, EnvironmentNamesTheConfigurationAtStartUp)
     std::ofstream(dir + "/env.properties") << "log4j.rootLogger=INFO, f\n" << appender("f", dir + "/env.txt");
     EXPECT_EXIT((HGLog::logEvent("f", "S", 1, "Test.Env", 3000, "from the environment"), std::_Exit(0)),
                 testing::ExitedWithCode(0), "");
-    EXPECT_EQ(readFile(dir + "/env.txt"), "Test.Env|INFO|from the environment\n");
+    EXPECT_EQ(ictest::slurp(dir + "/env.txt"), "Test.Env|INFO|from the environment\n");
 }
 
 } // namespace

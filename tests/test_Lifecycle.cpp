@@ -12,7 +12,6 @@ namespace IST = IC::InstCtrl;
 using Strings = std::vector<std::string>;
 using Nodes = std::vector<IC::Node*>;
 
-std::size_t count(Strings const& v, std::string const& s) { return static_cast<std::size_t>(std::count(v.begin(), v.end(), s)); }
 IC::Node* keptNode(IC::Node::SensorType type, unsigned int instance, unsigned int id, unsigned int parent,
                    std::string const& description)
 {

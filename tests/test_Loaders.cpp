@@ -24,7 +24,6 @@ IC::Number const kIV(IC::Version2{1, 0}), kMV(IC::Version2{2, 3});
 
 std::string err(char const* text) { return ictest::errText(IC::Error(1, IC::Number(7u), text)); }
 IC::ManagementInterface* object(ictest::Seen const& s) { return static_cast<IC::ManagementInterface*>(s.object); }
-std::size_t count(Strings const& v, std::string const& s) { return static_cast<std::size_t>(std::count(v.begin(), v.end(), s)); }
 // A reload of FPs announces nothing here (their nodes are not in the
 // store); a call would show as this error in its result.
 IC::Error sink(std::vector<IC::Alert> const&) { return IC::Error(1, IC::Number(99u), "not expected"); }

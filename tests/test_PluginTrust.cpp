@@ -13,7 +13,6 @@
 
 #include <cerrno>
 #include <cstring>
-#include <iterator>
 
 #include <dlfcn.h>
 #include <fcntl.h>
@@ -90,11 +89,7 @@ protected:
         }
     }
 
-    std::string markerText() const
-    {
-        std::ifstream in(marker_);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
+    std::string markerText() const { return ictest::slurp(marker_); }
 
     // Refused with exactly one error line that names the file and contains
     // why, and none of the library's code ran.

@@ -92,11 +92,6 @@ inline Seen& seen(std::string const& name)
     static Seen none;
     return none;
 }
-inline std::size_t seenCount()
-{
-    std::lock_guard<std::mutex> g(Harness::get().m);
-    return Harness::get().seen.size();
-}
 // Forgets records and nodes: only when no library is open.
 inline void forgetPlugins()
 {
@@ -114,6 +109,12 @@ inline std::vector<std::string> calls(LogCapture const& cap, std::string const& 
         if (m.compare(0, name.size() + 1, name + ":") == 0 || name.empty())
             out.push_back(m);
     return out;
+}
+
+// How many of the calls are call.
+inline std::size_t count(std::vector<std::string> const& calls, std::string const& call)
+{
+    return static_cast<std::size_t>(std::count(calls.begin(), calls.end(), call));
 }
 
 // True when a file whose path contains fragment is mapped into this process.

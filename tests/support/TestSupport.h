@@ -107,11 +107,6 @@ inline std::string ptrText(void const* p)
     os << p;
     return os.str();
 }
-template <class F>
-std::string fnText(F f)
-{
-    return ptrText(reinterpret_cast<void const*>(f));
-}
 
 // A fresh directory under /tmp, removed with everything in it.
 class TempDir {
