@@ -314,18 +314,16 @@ TEST_F(Dispatch, ARemovalNamingManyPathsDropsExactlyThoseAndRegistersStillMatchT
     // Back under its path, the node is matched through the register's own
     // set wherever the register is found, though the index lost the path.
     ASSERT_TRUE(ictest::addNew(ICC::nodestore, *sensors[4]));
-    struct Case {
-        Paths paths;
-        Deliveries expected;
-    } const cases[] = {
+    // The paths of an alert, and the deliveries it makes.
+    std::pair<Paths, Deliveries> const cases[] = {
         {{all[4]}, {}},
         {{all[4], P0}, {{1, "3/0/2/m/" + hex(all[4]) + "," + hex(P0) + ","}}},
         {{all[5], all[6], all[4]}, {{1, "3/0/2/m/" + hex(all[5]) + "," + hex(all[4]) + ","}}},
     };
-    for (Case const& c : cases) {
+    for (auto const& [paths, expected] : cases) {
         gDeliveries.clear();
-        expectError(ICC::AlertCallBackFP({alert(0, c.paths)}), 0);
-        EXPECT_EQ(gDeliveries, c.expected) << c.paths.size();
+        expectError(ICC::AlertCallBackFP({alert(0, paths)}), 0);
+        EXPECT_EQ(gDeliveries, expected) << paths.size();
     }
     ICC::registerForAlerts(recA, cls(7), &c2);
     gDeliveries.clear();

@@ -10,14 +10,6 @@ using IC::Node;
 using IC::Number;
 using Strings = std::vector<std::string>;
 
-template <class T>
-std::string streamed(T const& value)
-{
-    std::ostringstream os;
-    os << value;
-    return os.str();
-}
-
 // Equal only when made the same way from equal values; printed by form.
 TEST(CommonTypes, NumbersErrorsAndAlertsCompareAndPrint)
 {
@@ -33,8 +25,8 @@ TEST(CommonTypes, NumbersErrorsAndAlertsCompareAndPrint)
     copy = alert;
     std::string const text =
         "time=" + alert.getTimeStamp().toIso8601() + " severity=3 class=4 status=2 paths={1f5c,01} message=fan failed";
-    EXPECT_EQ((Strings{v.toString(), k.toString(), streamed(u), std::string(b), streamed(b), std::string(copy),
-                       streamed(alert)}),
+    EXPECT_EQ((Strings{v.toString(), k.toString(), ::testing::PrintToString(u), std::string(b),
+                       ::testing::PrintToString(b), std::string(copy), ::testing::PrintToString(alert)}),
               (Strings{"2.255", "kind 0", "7", "status=5 code=1 text=Load Library", "status=5 code=1 text=Load Library",
                        text, text}));
 }

@@ -61,27 +61,21 @@ TEST(FindLibs, OpensEveryLibraryOfTheDirectoryInNameOrder)
     EXPECT_TRUE(libs.empty());
 }
 
-IC::libstruct rec(std::string const& name, std::string const& path)
-{
-    IC::libstruct r;
-    r.name = name;
-    r.path = path;
-    return r;
-}
-
 // Only the bare name counts, compared byte by byte as unsigned characters,
 // a prefix first.
 TEST(LibOrder, BothLoadersCompareBareNamesByteWise)
 {
     for (auto lt : {&IC::MI_CONTROL::libLT, &IC::FP_CONTROL::libLT}) {
-        std::vector<IC::libstruct> v{rec("mi_b.so", "/a"), rec("\xe2\x82\xac.so", "/e"), rec("mi_a.so", "/z"),
-                                     rec("MI.so", "/m"), rec("mi_a", "/n"), rec("\x7f", "/p")};
+        // {handle, path, name}
+        std::vector<IC::libstruct> v{{nullptr, "/a", "mi_b.so"}, {nullptr, "/e", "\xe2\x82\xac.so"},
+                                     {nullptr, "/z", "mi_a.so"}, {nullptr, "/m", "MI.so"}, {nullptr, "/n", "mi_a"},
+                                     {nullptr, "/p", "\x7f"}};
         std::sort(v.begin(), v.end(), lt);
         std::string names;
         for (auto const& r : v)
             names += r.name + " ";
         EXPECT_EQ(names, "MI.so mi_a mi_a.so mi_b.so \x7f \xe2\x82\xac.so ");
-        EXPECT_FALSE(lt(rec("same.so", "/one"), rec("same.so", "/two")));
+        EXPECT_FALSE(lt({nullptr, "/one", "same.so"}, {nullptr, "/two", "same.so"}));
     }
 }
 

@@ -230,7 +230,7 @@ TEST_F(Icctl, PathConvertsBetweenItsForms)
 
 // ------------------------------------------------------ bad input, opening
 
-TEST_F(Icctl, BadInputIsRefusedWithAMessage)
+TEST_F(Icctl, BadInputAndAFailedOpenAreRefusedWithAMessage)
 {
     useFakeHw();
     std::string const nope = (dir_ / "nope").string();
@@ -270,10 +270,9 @@ TEST_F(Icctl, BadInputIsRefusedWithAMessage)
     setenv("IC_FP_DIR", fp_.c_str(), 1);
     EXPECT_EQ(bare({"tree"}).err,
               "icctl: management-interface directory '" + nope + "' does not exist (from IC_MI_DIR)\n");
-}
 
-TEST_F(Icctl, FailedOpenGivesTheLoadCode)
-{
+    // A library that cannot open gives its load code.
+    fs::remove(mi_ / "fakehw.so");
     fs::create_symlink(FAKEHW_BROKEN_PLUGIN, mi_ / "broken.so");
     Result const broken = icctl({"tree"});
     EXPECT_EQ(broken.status, 3);

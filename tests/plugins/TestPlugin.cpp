@@ -331,7 +331,6 @@ private:
             seen_->lookup(fans.front(), &found);
 #endif
         }
-        say("thread ended");
     }
 #ifndef TP_FP
     // The temperature turns critical or back to normal, or stays critical
