@@ -10,13 +10,6 @@ namespace {
 
 using HGLog::HGLogger;
 
-std::string readFile(std::string const& path)
-{
-    std::stringstream s;
-    s << std::ifstream(path).rdbuf();
-    return s.str();
-}
-
 // A file appender writing "%c|%p|%m" lines to file.
 std::string appender(std::string const& name, std::string const& file)
 {
@@ -74,8 +67,8 @@ TEST(HGLogger, ConfigurationSelectsLoggersAndTheTraceChannelSeparately)
     HGLog::logEvent("f", "S", 1, "Test.Cfg.C", 6000, "error of C");
     HGLogger::configureDefault(); // closes the files
     EXPECT_FALSE(HGLogger::isEnabled("Test.Cfg.A", 3000));
-    EXPECT_EQ(readFile(logOut), "Test.Cfg.A|INFO|progress of Test.Cfg.A\nTest.Cfg.C|ERROR|error of C\n");
-    EXPECT_EQ(readFile(traceOut), "HGTrace.Test.Cfg.B|INFO|progress of Test.Cfg.B\n");
+    EXPECT_EQ(ictest::slurp(logOut), "Test.Cfg.A|INFO|progress of Test.Cfg.A\nTest.Cfg.C|ERROR|error of C\n");
+    EXPECT_EQ(ictest::slurp(traceOut), "HGTrace.Test.Cfg.B|INFO|progress of Test.Cfg.B\n");
 }
 
 TEST(HGLoggerDeathTest, EnvironmentNamesTheConfigurationAtStartUp)
@@ -90,26 +83,7 @@ TEST(HGLoggerDeathTest, EnvironmentNamesTheConfigurationAtStartUp)
     std::ofstream(dir + "/env.properties") << "log4j.rootLogger=INFO, f\n" << appender("f", dir + "/env.txt");
     EXPECT_EXIT((HGLog::logEvent("f", "S", 1, "Test.Env", 3000, "from the environment"), std::_Exit(0)),
                 testing::ExitedWithCode(0), "");
-    EXPECT_EQ(readFile(dir + "/env.txt"), "Test.Env|INFO|from the environment\n");
-}
-
-TEST(HGLogger, ConcurrentLoggingAndListenerChanges)
-{
-    std::atomic<bool> stop{false};
-    std::vector<ictest::JoinedThread> loggers;
-    for (int t = 0; t < 4; ++t)
-        loggers.emplace_back([&stop, t] {
-            while (!stop.load())
-                HGLog::logEvent("f", "S", t, "Test.Threads", 3000, "thread ", t);
-        });
-    for (int i = 0; i < 200; ++i)
-        HGLogger::setListener(i % 2 ? HGLog::Listener() : [](HGLog::Record const&) {});
-    ictest::LogCapture cap;
-    EXPECT_TRUE(ictest::eventually([&] { return cap.records().size() >= 8; }));
-    stop = true;
-    loggers.clear();
-    for (auto const& r : cap.records())
-        EXPECT_EQ(r.message, "thread " + std::to_string(r.line));
+    EXPECT_EQ(ictest::slurp(dir + "/env.txt"), "Test.Env|INFO|from the environment\n");
 }
 
 } // namespace

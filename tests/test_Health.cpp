@@ -116,7 +116,7 @@ protected:
 
 // ---------------------------------------------------------------- relaying
 
-TEST_F(HealthTest, RelaysOnceAndTheAssertedStoreFollowsTheStatus)
+TEST_F(HealthTest, RelaysOnceTheAssertedStoreFollowsTheStatusAndAReloadedPlugInTakesOver)
 {
     open();
     void const* temps = watch(Node::TemperatureSensor);
@@ -143,11 +143,28 @@ TEST_F(HealthTest, RelaysOnceAndTheAssertedStoreFollowsTheStatus)
     EXPECT_EQ(got(removals),
               std::vector<std::string>{ictest::sig(Alert(1, Alert::NodeRemoval, {fan_}, 2, "fan removed"))});
     EXPECT_TRUE(asserted().empty());
+
+    // Released, it relays nothing any more (a registration left behind would
+    // call into the unloaded image).
+    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hot");
+    fs::remove(fp_ / "health.so");
+    IC::InstCtrl::TimedReload();
+    std::size_t const relayed = got(temps).size();
+    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hotter");
+    EXPECT_EQ(got(temps).size(), relayed);
+    // The new instance clears the roll-up the old one raised.
+    addHealth();
+    IC::InstCtrl::TimedReload();
+    void const* rollups = watch(shipped::kHealthRollup);
+    raise(Node::TemperatureSensor, 0, 0, shipped::kThreshold, 1, "normal");
+    EXPECT_TRUE(asserted().empty());
+    EXPECT_EQ(got(rollups), std::vector<std::string>{ictest::sig(Alert(0, shipped::kHealthRollup, {chassis_}, 1,
+                                                                       "health: all clear, no asserted alerts"))});
 }
 
 // ---------------------------------------------------------------- roll-up
 
-TEST_F(HealthTest, RollUpCarriesTheWorstAssertedCondition)
+TEST_F(HealthTest, RollUpCarriesTheWorstAssertedConditionAndARemovedInterfaceIsWithdrawn)
 {
     open();
     void const* rollups = watch(shipped::kHealthRollup);
@@ -176,12 +193,10 @@ TEST_F(HealthTest, RollUpCarriesTheWorstAssertedCondition)
                                                 s.rollupStatus, s.rollupMessage)));
         EXPECT_EQ(asserted()[chassis_], s.rollupStatus == 1 ? "" : "8/" + std::to_string(s.rollupStatus) + "/");
     }
-}
 
-TEST_F(HealthTest, ConcurrentAlertsLeaveAConsistentRollUp)
-{
-    open();
-    void const* rollups = watch(shipped::kHealthRollup);
+    // Concurrent alerts that both end normal: the last roll-up delivered and
+    // the store agree.
+    std::size_t const before = got(rollups).size();
     auto storm = [this](Node::SensorType type, unsigned int instance) {
         for (int i = 0; i < 200; ++i)
             hw_(type, instance, i % 2 ? 0 : 2, shipped::kThreshold, i % 2 ? 1 : 3, "storm");
@@ -190,17 +205,11 @@ TEST_F(HealthTest, ConcurrentAlertsLeaveAConsistentRollUp)
         ictest::JoinedThread a(storm, Node::TemperatureSensor, 0);
         ictest::JoinedThread b(storm, Node::Fan, 1);
     }
-    // Both end normal: the last roll-up delivered and the store agree.
     EXPECT_TRUE(asserted().empty());
-    ASSERT_FALSE(got(rollups).empty());
+    ASSERT_GT(got(rollups).size(), before);
     EXPECT_EQ(got(rollups).back().substr(0, 6), "0/8/1/");
-}
 
-// ---------------------------------------------------------- plug-ins changing
-
-TEST_F(HealthTest, WhatARemovedInterfaceAssertedIsWithdrawn)
-{
-    open();
+    // What an interface asserted is withdrawn when it goes.
     fs::create_symlink(FAKEHW2_PLUGIN, mi_ / "fakehw2.so");
     IC::InstCtrl::TimedReload();
     RaiseFn const second = raiseOf(mi_ / "fakehw2.so");
@@ -223,27 +232,6 @@ TEST_F(HealthTest, WhatARemovedInterfaceAssertedIsWithdrawn)
     EXPECT_EQ(asserted(), (std::map<std::string, std::string>{{fan_, "5/2/first fan slow"}, {chassis_, "8/2/"}}));
 }
 
-TEST_F(HealthTest, ReleaseDeregistersAndAReloadedPlugInTakesOver)
-{
-    open();
-    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hot");
-    void const* temps = watch(Node::TemperatureSensor);
-    fs::remove(fp_ / "health.so");
-    IC::InstCtrl::TimedReload();
-    // Nothing relays any more (a registration left behind would call into
-    // the unloaded image).
-    raise(Node::TemperatureSensor, 0, 2, shipped::kThreshold, 3, "hotter");
-    EXPECT_TRUE(got(temps).empty());
-    // The new instance clears the roll-up the old one raised.
-    addHealth();
-    IC::InstCtrl::TimedReload();
-    void const* rollups = watch(shipped::kHealthRollup);
-    raise(Node::TemperatureSensor, 0, 0, shipped::kThreshold, 1, "normal");
-    EXPECT_TRUE(asserted().empty());
-    EXPECT_EQ(got(rollups), std::vector<std::string>{ictest::sig(Alert(0, shipped::kHealthRollup, {chassis_}, 1,
-                                                                       "health: all clear, no asserted alerts"))});
-}
-
 // ------------------------------------------------ with the Linux interface
 
 #ifdef LINUXHW_PLUGIN
@@ -258,7 +246,6 @@ TEST_F(HealthTest, LinuxHwConditionsPresentAtStartAreAssertedWhenOpenReturns)
     // What getAssertedAlerts lists at once, by node description.
     std::map<std::string, std::map<std::string, std::string>> const trees = {
         {"small", {}},
-        {"large", {{chassis, "8/2/"}, {dimm, "6/2/" + dimm + ": 2 corrected memory errors counted"}}},
         {"degraded",
          {{chassis, "8/3/"},
           {dimm, "6/2/" + dimm + ": 2 corrected memory errors counted"},

@@ -123,8 +123,12 @@ std::string const kPackage = "CPU 0 Package id 0 temperature";
 
 // ------------------------------------------------------------------ the tree
 
-TEST_F(LinuxHwTest, SmallTreeLayoutAndProperties)
+// The small tree: its layout and properties; readings and alarms raise one
+// alert per change, odd files make a value unknown; devices arrive, leave and
+// come back under their path.
+TEST_F(LinuxHwTest, SmallTreeLayoutAlertsAndDevices)
 {
+    ictest::LogCapture log;
     open("small");
     std::string const chassis = "ROOT:00000000->Chassis:00000000";
     std::string const cpu = chassis + "->CPU:00000000";
@@ -170,9 +174,83 @@ TEST_F(LinuxHwTest, SmallTreeLayoutAndProperties)
     };
     for (auto const& p : props)
         EXPECT_EQ(prop(p[0], p[1]), p[2]) << p[0];
+
+    std::string const pkg = pathOf(kPackage);
+    std::string const warning = "5/2/1/CPU 0 Package id 0 temperature 100.0 C above warning 80.0 C";
+    // At the critical limit is not above it.
+    write("sys/class/hwmon/hwmon0/temp1_input", "100000");
+    expectAlerts(pkg, {warning});
+    std::string const critical = "5/3/2/CPU 0 Package id 0 temperature 101.0 C above critical 100.0 C";
+    write("sys/class/hwmon/hwmon0/temp1_input", "101000");
+    expectAlerts(pkg, {warning, critical});
+    write("sys/class/hwmon/hwmon0/temp1_input", "45000");
+    expectAlerts(pkg, {warning, critical, "5/1/0/CPU 0 Package id 0 temperature back to normal at 45.0 C"});
+    EXPECT_EQ(prop(kPackage, "state"), "ok");
+
+    std::string const core = pathOf("CPU 0 Core 1 temperature");
+    write("sys/class/hwmon/hwmon0/temp3_crit_alarm", "1");
+    expectAlerts(core, {"5/3/2/CPU 0 Core 1 temperature: hwmon alarm temp3_crit_alarm is set"});
+    EXPECT_EQ(prop("CPU 0 Core 1 temperature", "state"), "critical");
+    write("sys/class/hwmon/hwmon0/temp3_crit_alarm", "0");
+    expectAlerts(core, {"5/3/2/CPU 0 Core 1 temperature: hwmon alarm temp3_crit_alarm is set",
+                        "5/1/0/CPU 0 Core 1 temperature back to normal at 44.0 C"});
+    // An upper limit of 0 was never programmed; sensors that did not move
+    // raised nothing.
+    write("sys/class/hwmon/hwmon0/temp4_max", "0");
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "upper_warning") == "<none>"; }));
+
+    // Odd files make a value unknown and are logged once, not on every poll;
+    // good values come back without an alert.
+    auto logged = [&](std::string const& file) {
+        std::size_t n = 0;
+        for (HGLog::Record const& r : log.logs("Helmgard.Plugins.LinuxHW"))
+            n += r.message.find(file) != std::string::npos;
+        return n;
+    };
+    write("sys/class/hwmon/hwmon0/temp2_input", "hot!");
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "state") == "unknown"; }));
+    // A directory where a file should be cannot be read, by root either.
+    std::string const odd = root() + "/sys/class/hwmon/hwmon0/temp4_input";
+    fs::remove(odd);
+    fs::create_directory(odd);
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "reading") == "unknown"; }));
+    write("sys/class/hwmon/hwmon0/temp2_input", "43000");
+    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "reading") == "43.0 C"; }));
+    EXPECT_EQ(logged("temp2_input"), 1u);
+    EXPECT_EQ(logged("temp4_input"), 1u);
+    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
+    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 2 temperature")).empty());
+
+    // A new port, gone again, back again; a disk that goes.
+    std::size_t const before = nodes().size();
+    std::map<std::string, std::string> const eth9 = {
+        {"device/uevent", "PCI_SLOT_NAME=0000:03:00.0"}, {"address", "00:1b:21:aa:bb:cc"}, {"carrier", "1"},
+        {"speed", "10000"}};
+    install("sys/class/net/eth9", eth9);
+    std::string const description = "Network port eth9 (00:1b:21:aa:bb:cc)";
+    ASSERT_TRUE(eventually([&] { return nodes().size() == before + 1; }));
+    std::string const path = pathOf(description);
+    EXPECT_EQ(ic_->getNodeHierarchy(node(path)).rfind("ROOT:00000000->Chassis:00000000->Network Port:", 0), 0u);
+    EXPECT_EQ(prop(description, "speed"), "10000 Mb/s");
+    std::string const arrival = "3/1/0/" + description;
+    std::string const removal = "4/1/1/" + description + " was removed";
+    expectAlerts(path, {arrival});
+    fs::remove_all(root() + "/sys/class/net/eth9");
+    expectAlerts(path, {arrival, removal});
+    EXPECT_TRUE(eventually([&] { return node(path) == nullptr && nodes().size() == before; }));
+    // It comes back under the same path.
+    install("sys/class/net/eth9", eth9);
+    expectAlerts(path, {arrival, removal, arrival});
+
+    std::string const diskPath = pathOf(disk);
+    fs::remove_all(root() + "/sys/block/nvme0n1");
+    expectAlerts(diskPath, {"4/1/1/" + disk + " was removed"});
+    EXPECT_TRUE(eventually([&] { return node(diskPath) == nullptr; }));
 }
 
-TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAndStablePaths)
+// The large tree: instances, units and the alert classes of fans, supplies,
+// memory and links; paths survive a reopen.
+TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAlertsAndStablePaths)
 {
     open("large");
     std::map<Node::SensorType, std::size_t> counts;
@@ -208,77 +286,6 @@ TEST_F(LinuxHwTest, LargeTreeInstancesUnitsAndStablePaths)
     for (auto const& p : props)
         EXPECT_EQ(prop(p[0], p[1]), p[2]) << p[0];
 
-    // Paths survive a reopen, hwmon renumbering and a new device.
-    auto byDescription = [this] {
-        std::map<std::string, std::string> out;
-        for (Node* n : nodes())
-            out[n->getDescription()] = n->getPath();
-        return out;
-    };
-    std::map<std::string, std::string> const before = byDescription();
-    close();
-    // The kernel numbers hwmon chips in driver load order, and another card
-    // may come with the next boot: neither moves the others.
-    fs::rename(root() + "/sys/class/hwmon/hwmon0", root() + "/sys/class/hwmon/hwmon7");
-    fs::rename(root() + "/sys/class/hwmon/hwmon2", root() + "/sys/class/hwmon/hwmon0");
-    install("sys/class/net/eno3", {{"device/uevent", "PCI_SLOT_NAME=0000:19:00.2"},
-                                   {"address", "b4:96:91:4a:10:03"}, {"carrier", "1"}});
-    open();
-    std::map<std::string, std::string> after = byDescription();
-    EXPECT_EQ(after.size(), before.size() + 1);
-    for (auto const& [description, path] : before)
-        EXPECT_EQ(after[description], path) << description;
-}
-
-TEST_F(LinuxHwTest, ThermalZonesStandInWhenThereIsNoHwmon)
-{
-    useTree("small");
-    fs::remove_all(root() + "/sys/class/hwmon");
-    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast"); // not a number: the default interval
-    open();
-    std::vector<std::string> temps;
-    for (Node* n : nodes())
-        if (n->getSensor() == Node::TemperatureSensor)
-            temps.push_back(ic_->getNodeHierarchy(n) + " " + n->getDescription());
-    EXPECT_EQ(temps, std::vector<std::string>{"ROOT:00000000->Chassis:00000000->Temperature Sensor:00000000 Thermal zone 0 (x86_pkg_temp)"});
-    EXPECT_EQ(prop("Thermal zone 0 (x86_pkg_temp)", "reading"), "45.0 C");
-}
-
-// ------------------------------------------------------------------ alerts
-
-TEST_F(LinuxHwTest, ReadingsAndAlarmsRaiseOneAlertPerChange)
-{
-    open("small");
-    std::string const pkg = pathOf(kPackage);
-    std::string const warning = "5/2/1/CPU 0 Package id 0 temperature 100.0 C above warning 80.0 C";
-    // At the critical limit is not above it.
-    write("sys/class/hwmon/hwmon0/temp1_input", "100000");
-    expectAlerts(pkg, {warning});
-    std::string const critical = "5/3/2/CPU 0 Package id 0 temperature 101.0 C above critical 100.0 C";
-    write("sys/class/hwmon/hwmon0/temp1_input", "101000");
-    expectAlerts(pkg, {warning, critical});
-    write("sys/class/hwmon/hwmon0/temp1_input", "45000");
-    expectAlerts(pkg, {warning, critical, "5/1/0/CPU 0 Package id 0 temperature back to normal at 45.0 C"});
-    EXPECT_EQ(prop(kPackage, "state"), "ok");
-
-    std::string const core = pathOf("CPU 0 Core 1 temperature");
-    write("sys/class/hwmon/hwmon0/temp3_crit_alarm", "1");
-    expectAlerts(core, {"5/3/2/CPU 0 Core 1 temperature: hwmon alarm temp3_crit_alarm is set"});
-    EXPECT_EQ(prop("CPU 0 Core 1 temperature", "state"), "critical");
-    write("sys/class/hwmon/hwmon0/temp3_crit_alarm", "0");
-    expectAlerts(core, {"5/3/2/CPU 0 Core 1 temperature: hwmon alarm temp3_crit_alarm is set",
-                        "5/1/0/CPU 0 Core 1 temperature back to normal at 44.0 C"});
-    // An upper limit of 0 was never programmed; sensors that did not move
-    // raised nothing.
-    write("sys/class/hwmon/hwmon0/temp4_max", "0");
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "upper_warning") == "<none>"; }));
-    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
-    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 2 temperature")).empty());
-}
-
-TEST_F(LinuxHwTest, FansSuppliesMemoryAndLinksRaiseTheirClasses)
-{
-    open("large");
     std::string const psu = "Power supply PSU2 (Mains)";
     std::string const dimm = "DIMM CPU_SrcID#0_MC#0_Chan#1_DIMM#0";
     std::string const port = "Network port eno1 (b4:96:91:4a:10:01)";
@@ -309,63 +316,30 @@ TEST_F(LinuxHwTest, FansSuppliesMemoryAndLinksRaiseTheirClasses)
     for (char const* quiet : {"Network port eno2 (b4:96:91:4a:10:02)", "DIMM CPU_SrcID#1_MC#0_Chan#2_DIMM#0",
                               "nct6779 fan6 speed"})
         EXPECT_TRUE(alerts(pathOf(quiet)).empty()) << quiet;
-}
 
-TEST_F(LinuxHwTest, DevicesArriveLeaveAndComeBackUnderTheirPath)
-{
-    open("small");
-    std::size_t const before = nodes().size();
-    std::map<std::string, std::string> const eth9 = {
-        {"device/uevent", "PCI_SLOT_NAME=0000:03:00.0"}, {"address", "00:1b:21:aa:bb:cc"}, {"carrier", "1"},
-        {"speed", "10000"}};
-    install("sys/class/net/eth9", eth9);
-    std::string const description = "Network port eth9 (00:1b:21:aa:bb:cc)";
-    ASSERT_TRUE(eventually([&] { return nodes().size() == before + 1; }));
-    std::string const path = pathOf(description);
-    EXPECT_EQ(ic_->getNodeHierarchy(node(path)).rfind("ROOT:00000000->Chassis:00000000->Network Port:", 0), 0u);
-    EXPECT_EQ(prop(description, "speed"), "10000 Mb/s");
-    std::string const arrival = "3/1/0/" + description;
-    std::string const removal = "4/1/1/" + description + " was removed";
-    expectAlerts(path, {arrival});
-    fs::remove_all(root() + "/sys/class/net/eth9");
-    expectAlerts(path, {arrival, removal});
-    EXPECT_TRUE(eventually([&] { return node(path) == nullptr && nodes().size() == before; }));
-    // It comes back under the same path.
-    install("sys/class/net/eth9", eth9);
-    expectAlerts(path, {arrival, removal, arrival});
-
-    std::string const disk = pathOf("Disk nvme0n1: Samsung SSD 980 PRO 1TB (1000 GB)");
-    fs::remove_all(root() + "/sys/block/nvme0n1");
-    expectAlerts(disk, {"4/1/1/Disk nvme0n1: Samsung SSD 980 PRO 1TB (1000 GB) was removed"});
-    EXPECT_TRUE(eventually([&] { return node(disk) == nullptr; }));
+    // Paths survive a reopen, hwmon renumbering and a new device.
+    auto byDescription = [this] {
+        std::map<std::string, std::string> out;
+        for (Node* n : nodes())
+            out[n->getDescription()] = n->getPath();
+        return out;
+    };
+    std::map<std::string, std::string> const before = byDescription();
+    close();
+    // The kernel numbers hwmon chips in driver load order, and another card
+    // may come with the next boot: neither moves the others.
+    fs::rename(root() + "/sys/class/hwmon/hwmon0", root() + "/sys/class/hwmon/hwmon7");
+    fs::rename(root() + "/sys/class/hwmon/hwmon2", root() + "/sys/class/hwmon/hwmon0");
+    install("sys/class/net/eno3", {{"device/uevent", "PCI_SLOT_NAME=0000:19:00.2"},
+                                   {"address", "b4:96:91:4a:10:03"}, {"carrier", "1"}});
+    open();
+    std::map<std::string, std::string> after = byDescription();
+    EXPECT_EQ(after.size(), before.size() + 1);
+    for (auto const& [description, path] : before)
+        EXPECT_EQ(after[description], path) << description;
 }
 
 // ------------------------------------------------------------------ bad input
-
-TEST_F(LinuxHwTest, OddFilesAreUnknownAndLoggedOnce)
-{
-    ictest::LogCapture log;
-    open("small");
-    auto logged = [&](std::string const& file) {
-        std::size_t n = 0;
-        for (HGLog::Record const& r : log.logs("Helmgard.Plugins.LinuxHW"))
-            n += r.message.find(file) != std::string::npos;
-        return n;
-    };
-    write("sys/class/hwmon/hwmon0/temp2_input", "hot!");
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "state") == "unknown"; }));
-    // A directory where a file should be cannot be read, by root either.
-    std::string const odd = root() + "/sys/class/hwmon/hwmon0/temp4_input";
-    fs::remove(odd);
-    fs::create_directory(odd);
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 2 temperature", "reading") == "unknown"; }));
-    // Logged once, not on every poll; good values come back without an alert.
-    write("sys/class/hwmon/hwmon0/temp2_input", "43000");
-    EXPECT_TRUE(eventually([&] { return prop("CPU 0 Core 0 temperature", "reading") == "43.0 C"; }));
-    EXPECT_EQ(logged("temp2_input"), 1u);
-    EXPECT_EQ(logged("temp4_input"), 1u);
-    EXPECT_TRUE(alerts(pathOf("CPU 0 Core 0 temperature")).empty());
-}
 
 TEST_F(LinuxHwTest, HostileNumbersAreUnknownAndNeverCrash)
 {
@@ -429,39 +403,38 @@ TEST_F(LinuxHwTest, HostileNumbersAreUnknownAndNeverCrash)
     EXPECT_TRUE(eventually([&] { return prop("hostile temp3 temperature", "reading") == "-6.0 C"; }));
 }
 
-TEST_F(LinuxHwTest, MissingRootAndOddIntervalStillLoad)
+// Without hwmon, thermal zones stand in. Unloading must wake the poller that
+// waits for its interval, and the nodes' code leaves with the plug-in: the
+// library forgets every node. Without any tree, the host, its chassis and its
+// memory are still there, whatever the interval says.
+TEST_F(LinuxHwTest, ThermalZonesStandInAndUnloadingForgetsEveryNode)
 {
+    useTree("small");
+    fs::remove_all(root() + "/sys/class/hwmon");
     {
         ictest::EnvGuard slow("IC_LINUXHW_POLL_MS", "600000");
         open();
     }
+    std::string const zone = "Thermal zone 0 (x86_pkg_temp)";
+    EXPECT_EQ(ic_->getNodeHierarchy(node(pathOf(zone))), "ROOT:00000000->Chassis:00000000->Temperature Sensor:00000000");
+    EXPECT_EQ(prop(zone, "reading"), "45.0 C");
+    {
+        ictest::Watchdog guard(30, "unloading while the polling thread waits");
+        close();
+    }
+    std::vector<Node*> left;
+    IC::InstCtrl::nodestore.getAllNodes(left);
+    EXPECT_TRUE(left.empty());
+
+    fs::remove_all(root());
+    ictest::EnvGuard fast("IC_LINUXHW_POLL_MS", "fast"); // not a number: the default interval
+    open();
     std::vector<std::string> types;
     for (Node* n : nodes())
         types.push_back(ic_->getNodeHierarchy(n));
     std::sort(types.begin(), types.end());
     EXPECT_EQ(types, (std::vector<std::string>{"ROOT:00000000", "ROOT:00000000->Chassis:00000000",
                                                "ROOT:00000000->Chassis:00000000->RAM:00000000"}));
-    {
-        // The polling thread waits for its interval; unloading must wake it.
-        ictest::Watchdog guard(30, "unloading while the polling thread waits");
-        close();
-    }
-}
-
-// ------------------------------------------------------------------ lifecycle
-
-TEST_F(LinuxHwTest, UnloadingOnThisMachineMakesTheLibraryForgetEveryNode)
-{
-    // The nodes' code leaves with the plug-in: no pointer may stay behind.
-    ictest::EnvGuard real("IC_SYSFS_ROOT", "/");
-    IC::Error* err = nullptr;
-    ASSERT_EQ(Open(&ic_, &err), 0);
-    ASSERT_GE(nodes().size(), 4u); // ROOT, chassis, a CPU, the memory at least
-    std::this_thread::sleep_for(std::chrono::milliseconds(200)); // a few polls of the real tree
-    close();
-    std::vector<Node*> left;
-    IC::InstCtrl::nodestore.getAllNodes(left);
-    EXPECT_TRUE(left.empty());
 }
 
 } // namespace

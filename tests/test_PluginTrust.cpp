@@ -12,9 +12,7 @@
 #include <TestSupport.h>
 
 #include <cerrno>
-#include <cstdint>
 #include <cstring>
-#include <iterator>
 
 #include <dlfcn.h>
 #include <fcntl.h>
@@ -47,17 +45,10 @@ std::string nameOf(SD::_LibraryHandle* h)
     return fn ? fn() : "<no trust_name>";
 }
 
-// The file mapped at address, from /proc/self/maps; "" when none is.
-std::string fileAt(void const* address)
+// The file the library is, as the loader names it.
+std::string fileOf(SD::_LibraryHandle* h)
 {
-    auto const a = reinterpret_cast<std::uintptr_t>(address);
-    std::ifstream maps("/proc/self/maps");
-    for (std::string line; std::getline(maps, line);) {
-        unsigned long long start = 0, end = 0;
-        if (std::sscanf(line.c_str(), "%llx-%llx", &start, &end) == 2 && a >= start && a < end)
-            return line.find('/') == std::string::npos ? std::string() : line.substr(line.find('/'));
-    }
-    return std::string();
+    return symbol<char const* (*)()>(h, "trust_file")();
 }
 
 class PluginTrust : public ::testing::Test {
@@ -98,11 +89,7 @@ protected:
         }
     }
 
-    std::string markerText() const
-    {
-        std::ifstream in(marker_);
-        return std::string(std::istreambuf_iterator<char>(in), {});
-    }
+    std::string markerText() const { return ictest::slurp(marker_); }
 
     // Refused with exactly one error line that names the file and contains
     // why, and none of the library's code ran.
@@ -129,8 +116,7 @@ protected:
         Handle const h = load(file);
         ASSERT_NE(h, nullptr);
         EXPECT_EQ(nameOf(h.get()), name);
-        std::string const self = symbol<char const* (*)()>(h.get(), "trust_file")();
-        EXPECT_EQ(std::filesystem::path(self).lexically_normal(), std::filesystem::canonical(file)) << self;
+        EXPECT_EQ(std::filesystem::path(fileOf(h.get())).lexically_normal(), std::filesystem::canonical(file));
         EXPECT_EQ(markerText(), name + "\n");
         for (auto const& r : cap.logs())
             EXPECT_LT(r.level, kWarning) << r.message;
@@ -240,7 +226,7 @@ TEST_F(PluginTrust, EachHandleGivesTheCodeOfItsOwnFileEvenAfterALingeringOne)
         Handle const a = load(path("a.so")), b = load(path("b.so"));
         ASSERT_TRUE(a && b);
         for (auto const& [h, name] : {std::pair{a.get(), "a.so"}, std::pair{b.get(), "b.so"}}) {
-            EXPECT_EQ(fileAt(symbol<void*>(h, "trust_name")), path(name));
+            EXPECT_EQ(fileOf(h), path(name));
             EXPECT_EQ(symbol<char const* (*)()>(h, "trust_whoami")(), nameOf(h));
         }
         EXPECT_EQ(nameOf(b.get()), "trust_other");
@@ -257,34 +243,25 @@ TEST_F(PluginTrust, EachHandleGivesTheCodeOfItsOwnFileEvenAfterALingeringOne)
 
 // A scan reuses the walk down to a directory, never the verdict on a file:
 // in one pass, each file of the directory is still judged on its own, and a
-// file elsewhere gets its own walk.
-TEST_F(PluginTrust, InAScanEachFileIsStillJudgedOnItsOwn)
+// file elsewhere gets its own walk. The verdict on the directories lasts as
+// long as the scan: a directory opened to others during a pass is refused
+// from the next pass on. An inner scan keeps its own verdicts and leaves the
+// outer one's alone.
+TEST_F(PluginTrust, InAScanEachFileIsJudgedOnItsOwnAndEachDirectoryOnce)
 {
-    ASSERT_NO_FATAL_FAILURE(build("dir mi 0755; dir open 0777; copy trust_probe mi/a.so; copy trust_probe mi/w.so 0666;"
-                                  "fifo mi/pipe.so; copy trust_other o.so; link {root}/o.so mi/link.so;"
-                                  "copy trust_probe open/c.so"));
-    SD::PlatformUtilities::Scan const scan;
-    expectAccepted(path("mi/a.so"), "trust_probe");
-    expectRefused(path("mi/w.so"), "is writable by group or others (mode 0666)");
-    expectRefused(path("mi/pipe.so"), "not a regular file");
-    expectRefused(path("mi/missing.so"), "No such file or directory");
-    expectRefused(path("open/c.so"), "directory " + path("open") + " is writable");
-    expectRefused(path("mi/.."), "not a regular file");
-    expectAccepted(path("mi/link.so"), "trust_other");
-    expectAccepted(path("mi/a.so"), "trust_probe");
-}
-
-// The verdict on the directories lasts as long as the scan: a directory
-// opened to others during a pass is refused from the next pass on. An
-// inner scan keeps its own verdicts and leaves the outer one's alone.
-TEST_F(PluginTrust, DirectoriesAreJudgedOncePerScan)
-{
-    ASSERT_NO_FATAL_FAILURE(
-        build("dir mi 0755; dir fp 0755; copy trust_probe mi/a.so; copy trust_probe mi/b.so; "
-              "copy trust_other fp/f.so"));
+    ASSERT_NO_FATAL_FAILURE(build("dir mi 0755; dir open 0777; dir fp 0755; copy trust_probe mi/a.so;"
+                                  "copy trust_probe mi/b.so; copy trust_probe mi/w.so 0666; fifo mi/pipe.so;"
+                                  "copy trust_other o.so; link {root}/o.so mi/link.so; copy trust_other open/a.so;"
+                                  "copy trust_other fp/f.so"));
     {
         SD::PlatformUtilities::Scan const outer;
         expectAccepted(path("mi/a.so"), "trust_probe");
+        expectRefused(path("mi/w.so"), "is writable by group or others (mode 0666)");
+        expectRefused(path("mi/pipe.so"), "not a regular file");
+        expectRefused(path("mi/missing.so"), "No such file or directory");
+        expectRefused(path("open/a.so"), "directory " + path("open") + " is writable");
+        expectRefused(path("mi/.."), "not a regular file");
+        expectAccepted(path("mi/link.so"), "trust_other");
         {
             SD::PlatformUtilities::Scan const inner;
             expectAccepted(path("fp/f.so"), "trust_other");

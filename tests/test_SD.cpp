@@ -19,6 +19,7 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 using ictest::JoinedThread;
+using ictest::lockableFromAnotherThread;
 using Names = std::vector<std::string>;
 
 constexpr unsigned long NO_LIMIT = 0xFFFFFFFFUL;
@@ -29,16 +30,6 @@ constexpr unsigned long GENEROUS_MS = 5000;
 long long elapsedMs(Clock::time_point since)
 {
     return std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - since).count();
-}
-
-bool lockableFromAnotherThread(SD::Mutex& m)
-{
-    bool taken = false;
-    JoinedThread([&] {
-        if ((taken = m.try_lock()))
-            m.unlock();
-    }).join();
-    return taken;
 }
 
 // Recursive: the owner locks again, others wait until every level is
@@ -58,13 +49,7 @@ TEST(SDMutex, OwnerLocksAgainOthersWaitOrTimeOut)
     EXPECT_EQ(timedOut.load(), 1);
     EXPECT_GE(elapsedMs(t0), 1050) << "a timed lock must not give up early";
     m.unlock();
-    try {
-        SD::MutexGuard g(m);
-        EXPECT_FALSE(lockableFromAnotherThread(m));
-        throw std::runtime_error("leaving the scope early");
-    } catch (std::runtime_error const&) {
-    }
-    EXPECT_TRUE(lockableFromAnotherThread(m)) << "the guard releases on an exception";
+    EXPECT_TRUE(lockableFromAnotherThread(m)) << "every level released";
 }
 
 TEST(SDEvent, ManualResetStaysSignalledAndAutoResetIsConsumedByOneWait)
@@ -216,20 +201,18 @@ TEST(SDDirectoryReader, ListsEntriesOfEveryTypeEndingWithTheSuffixSortedByteWise
     EXPECT_EQ(names(r), want);
     for (int bad : {7, -1, INT_MAX, INT_MIN})
         EXPECT_EQ(r.getFileName(bad), nullptr) << bad;
-    // An empty or null suffix lists everything but the dot entries; a
-    // trailing separator still gets one more.
+    // An empty or null suffix lists everything but the dot entries. (A
+    // trailing separator is the plug-in discovery test's.)
     EXPECT_EQ(names(SD::DirectoryReader(d.root().c_str(), "")).size(), 12u);
     EXPECT_EQ(names(SD::DirectoryReader(d.root().c_str(), nullptr)).size(), 12u);
-    EXPECT_EQ(names(SD::DirectoryReader((d.root() + "/").c_str(), "so.1")), Names{d.root() + "//b.so.1"});
     for (char const* none : {"/nothing-here", "/a.so"})
         EXPECT_EQ(SD::DirectoryReader((d.root() + none).c_str(), "").getNumberOfFiles(), 0) << none;
     EXPECT_EQ(SD::DirectoryReader(nullptr, ".so").getFileName(0), nullptr);
 }
 
 // Read on every call; unset or empty means the installation's default.
-TEST(SDPlatformUtilities, SeparatorAndDirectoriesFromTheEnvironmentOnEveryCall)
+TEST(SDPlatformUtilities, DirectoriesFromTheEnvironmentOnEveryCall)
 {
-    EXPECT_EQ(SD::PlatformUtilities::getSeparator(), '/');
     char const* const vars[] = {"IC_DATA_DIR", "IC_MI_DIR", "IC_FP_DIR"};
     std::string (*const get[])() = {&SD::PlatformUtilities::getBriscaDataDir,
                                     &SD::PlatformUtilities::getBriscaMIDir, &SD::PlatformUtilities::getBriscaFPDir};

@@ -22,8 +22,8 @@ namespace ictest {
 
 enum Mode {
     MODE_GOOD, MODE_SLOW, MODE_NO_ENTRY, MODE_CODE, MODE_NULL_ERROR, MODE_ERROR_STATUS, MODE_NULL_OBJECT,
-    MODE_BROKEN, MODE_INIT_FAILS, MODE_REG_FAILS, MODE_GETMAP_FAILS, MODE_GETMAP_THROWS, MODE_THROW_OPEN,
-    MODE_THROW_INIT, MODE_THROW_INT, MODE_THROW_INT_OPEN,
+    MODE_INIT_FAILS, MODE_REG_FAILS, MODE_GETMAP_FAILS, MODE_GETMAP_THROWS, MODE_THROW_INIT,
+    MODE_THROW_INT, // throws an int from its entry point
     MODE_ANNOUNCE,    // announces its nodes through MapNewFPNode
     MODE_ACTIVE,      // announces, registers for its own supply, asserts an alert on it
     MODE_RELAY,       // re-raises what interfaces raise on CPUs and fans, through the harness
@@ -67,7 +67,6 @@ inline std::string const kLogIC = "Helmgard.IC.InstrumentationControl";
 inline std::string const kLogMI = kLogIC + ".MIControl";
 inline std::string const kLogFP = kLogIC + ".FPControl";
 inline std::string const kLogLT = kLogIC + ".LoaderThread";
-inline std::string const kLogLC = "Helmgard.IC.LoadControl";
 inline std::string const kLogPlugin = "ictest.plugin";
 
 struct Harness {
@@ -93,11 +92,6 @@ inline Seen& seen(std::string const& name)
     static Seen none;
     return none;
 }
-inline std::size_t seenCount()
-{
-    std::lock_guard<std::mutex> g(Harness::get().m);
-    return Harness::get().seen.size();
-}
 // Forgets records and nodes: only when no library is open.
 inline void forgetPlugins()
 {
@@ -115,6 +109,12 @@ inline std::vector<std::string> calls(LogCapture const& cap, std::string const& 
         if (m.compare(0, name.size() + 1, name + ":") == 0 || name.empty())
             out.push_back(m);
     return out;
+}
+
+// How many of the calls are call.
+inline std::size_t count(std::vector<std::string> const& calls, std::string const& call)
+{
+    return static_cast<std::size_t>(std::count(calls.begin(), calls.end(), call));
 }
 
 // True when a file whose path contains fragment is mapped into this process.

@@ -163,8 +163,6 @@ public:
         }
         if (Error const e = initFails(); e.getStatus() != 0)
             return e;
-        if (kMode == MODE_THROW_INT)
-            throw 42;
         std::lock_guard<std::mutex> g(m_);
         seen_->base = base_ = base;
         add(Node::ROOT, TP_INSTANCE, 0, "Fake server");
@@ -333,7 +331,6 @@ private:
             seen_->lookup(fans.front(), &found);
 #endif
         }
-        say("thread ended");
     }
 #ifndef TP_FP
     // The temperature turns critical or back to normal, or stays critical
@@ -383,15 +380,8 @@ unsigned char open(char const* entry, Object** object, Error** err)
     say(entry);
     if (kMode == MODE_CODE)
         return 'X';
-    if (kMode == MODE_THROW_OPEN)
-        throw std::runtime_error("open exploded");
-    if (kMode == MODE_THROW_INT_OPEN)
+    if (kMode == MODE_THROW_INT)
         throw 42;
-    if (kMode == MODE_BROKEN) {
-        *object = nullptr;
-        *err = &bad;
-        return 1;
-    }
     if (kMode != MODE_NULL_OBJECT)
         *object = new Plugin;
     if (kMode != MODE_NULL_ERROR)

@@ -70,38 +70,17 @@ inline IC::Error answer(unsigned char status, unsigned int code, char const* tex
 inline IC::Error recArrival(IC::Node* const&, void const*) { return answer(0, 101, "arrival"); }
 inline IC::Error recLookup(std::string const&, IC::Node**) { return answer(1, 102, "lookup"); }
 
-// The eleven services, each distinct.
-using Paths = std::vector<std::string>;
-using SensorType = IC::Node::SensorType;
-inline IC::Error svRegPath(IC::AlertCallBack, Paths const&, void const*) { return answer(0, 201, "reg path"); }
-inline IC::Error svDeRegPath(IC::AlertCallBack, Paths const&, void const*) { return answer(0, 202, "dereg path"); }
+// The services for FPs loaded directly: the test plug-ins these tests load
+// call only the announcement; the alert entry tells the services apart.
 inline IC::Error svAlert(std::vector<IC::Alert> const&) { return answer(0, 203, "alert"); }
-inline IC::Error svAssert(std::vector<IC::Alert> const&) { return answer(0, 204, "assert"); }
 inline IC::Error svMapNode(IC::Node* const&) { return answer(0, 205, "map node"); }
-inline IC::Error svRegSensor(IC::AlertCallBack, SensorType, void const*) { return answer(0, 206, "reg sensor"); }
-inline IC::Error svDeRegSensor(IC::AlertCallBack, SensorType, void const*) { return answer(0, 207, "dereg sensor"); }
 
 inline IC::ICforFP makeServices(std::vector<IC::ManagementInterface*> const& mis,
                                 IC::InstrumentationControl* facade)
 {
     IC::NodeAnnouncement const announce = &svMapNode;
-    return IC::ICforFP(mis, &svRegPath, &svDeRegPath, &svAlert, &svAssert,
-                       IC::Number(IC::Version2{1, 0}), IC::Number(IC::Version2{2, 3}), announce,
-                       facade, &svRegSensor, &svDeRegSensor);
-}
-
-// Every value of s equals what makeServices(mis, facade) put in.
-inline void expectServices(IC::ICforFP const& s, std::vector<IC::ManagementInterface*> const& mis,
-                           IC::InstrumentationControl* facade)
-{
-    EXPECT_EQ(s.getMIs(), mis);
-    EXPECT_TRUE(s.getRegFPAlerts() == &svRegPath && s.getDeRegFPAlerts() == &svDeRegPath);
-    EXPECT_TRUE(s.getAlertCallBackFP() == &svAlert && s.getAssertCallBackFP() == &svAssert);
-    EXPECT_EQ(s.getInterfaceVersion(), IC::Number(IC::Version2{1, 0}));
-    EXPECT_EQ(s.getModuleVersion(), IC::Number(IC::Version2{2, 3}));
-    EXPECT_EQ(s.getMapNewFPNode(), &svMapNode);
-    EXPECT_EQ(s.getInstrumentationControl(), facade);
-    EXPECT_TRUE(s.getRegFPsensorAlerts() == &svRegSensor && s.getDeRegFPsensorAlerts() == &svDeRegSensor);
+    return IC::ICforFP(mis, nullptr, nullptr, &svAlert, nullptr, IC::Number(IC::Version2{1, 0}),
+                       IC::Number(IC::Version2{2, 3}), announce, facade, nullptr, nullptr);
 }
 
 } // namespace ictest

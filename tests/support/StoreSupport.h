@@ -65,14 +65,4 @@ struct CleanAlertState {
     ~CleanAlertState() { resetAlertState(); }
 };
 
-// True when no registration of any kind is left.
-inline bool noRegistrations()
-{
-    namespace ICC = IC::InstCtrl;
-    SD::MutexGuard g(ICC::registerlock);
-    return ICC::callbacks.empty() && ICC::nodepathTOalertregister.empty() &&
-           ICC::sensortypeTOalertregister.empty() && ICC::classtypeTOalertregister.empty() &&
-           ICC::mysam.empty();
-}
-
 } // namespace ictest

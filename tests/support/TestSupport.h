@@ -107,11 +107,6 @@ inline std::string ptrText(void const* p)
     os << p;
     return os.str();
 }
-template <class F>
-std::string fnText(F f)
-{
-    return ptrText(reinterpret_cast<void const*>(f));
-}
 
 // A fresh directory under /tmp, removed with everything in it.
 class TempDir {
@@ -172,6 +167,18 @@ struct JoinedThread : std::thread {
             join();
     }
 };
+
+// True when another thread can take the lock m (an SD::Mutex) right now.
+template <class Lock>
+bool lockableFromAnotherThread(Lock& m)
+{
+    bool taken = false;
+    JoinedThread([&] {
+        if ((taken = m.try_lock()))
+            m.unlock();
+    }).join();
+    return taken;
+}
 
 // A file's bytes; the standard output of a shell command; a text's lines.
 inline std::string slurp(std::filesystem::path const& file)

@@ -46,25 +46,17 @@ extern "C" __attribute__((visibility("default"))) int trust_through_dep()
 
 extern "C" {
 
-__attribute__((visibility("default"))) int trust_counter = 0;
-
 __attribute__((visibility("default"), noinline)) char const* trust_name()
 {
     return TRUST_NAME;
 }
 
-// Reaches trust_name and trust_counter the way any use of an exported name
-// does, through the dynamic linker: were the builds loaded into one global
-// scope, the first one's would answer for all.
+// Reaches trust_name the way any use of an exported name does, through the
+// dynamic linker: were the builds loaded into one global scope, the first
+// one's would answer for all.
 __attribute__((visibility("default"))) char const* trust_whoami()
 {
-    ++trust_counter;
     return trust_name();
-}
-
-__attribute__((visibility("default"))) int trust_count()
-{
-    return trust_counter;
 }
 
 // The file this library is, as the loader names it to anyone who asks: what
