@@ -50,6 +50,84 @@ Error const& notFound()
     return e;
 }
 
+// The path of a node below a parent whose path is known: the node's own
+// pair (instance digits, 15, type digits, 0) in front of the parent's
+// pairs, packed two nibbles to a byte with a final odd nibble dropped.
+// These are the bytes nodecode gives for the node's pair followed by the
+// parent's pairs as uniqueid2topovec reads them (up to and including the
+// first invalid one), without decoding and encoding the parent again.
+std::string extendPath(std::string const& parent, unsigned int type, unsigned int instance)
+{
+    unsigned char own[20]; // 9 base-12 digits hold any 32-bit number
+    std::size_t n = 0;
+    auto const number = [&own, &n](unsigned int v) {
+        std::size_t const first = n;
+        do {
+            own[n++] = static_cast<unsigned char>(1 + v % 12);
+            v /= 12;
+        } while (v != 0);
+        std::reverse(own + first, own + n);
+    };
+    number(instance);
+    own[n++] = 15;
+    number(type);
+    own[n++] = 0;
+
+    // The parent's nibbles: its bytes', and the closing 0 its packing
+    // dropped when its last nibble is a digit. Only its first pair counts
+    // when that pair is invalid (the parent's own type); a cached path has
+    // no other invalid pair but its last.
+    std::size_t const whole = 2 * parent.size() + (!parent.empty() && (parent.back() & 15) != 0);
+    auto const nibble = [&parent](std::size_t i) -> unsigned int {
+        return i / 2 < parent.size() ? (static_cast<unsigned char>(parent[i / 2]) >> (i % 2 ? 0 : 4)) & 15u : 0u;
+    };
+    std::size_t count = whole;
+    unsigned int firstType = 0;
+    bool inType = false;
+    for (std::size_t i = 0; i < whole; ++i) {
+        unsigned int const v = nibble(i);
+        if (v == 0) {
+            if (firstType == Node::invalid)
+                count = i + 1;
+            break;
+        }
+        if (v == 15)
+            inType = true;
+        else if (inType && v < 13)
+            firstType = firstType * 12 + (v - 1);
+    }
+
+    std::string out;
+    out.reserve(n / 2 + parent.size() + 1);
+    for (std::size_t i = 0; i + 1 < n; i += 2)
+        out += static_cast<char>(own[i] << 4 | own[i + 1]);
+    if (count == whole) {
+        if (n % 2 == 0)
+            return out += parent;
+        // Out of step by a nibble: the parent's nibbles shift across its bytes.
+        unsigned int high = own[n - 1];
+        for (unsigned char c : parent) {
+            out += static_cast<char>(high << 4 | c >> 4);
+            high = c & 15u;
+        }
+        if (high != 0) // the dropped closing 0 completes the last byte
+            out += static_cast<char>(high << 4);
+        return out;
+    }
+    int high = n % 2 ? own[n - 1] : -1;
+    for (std::size_t i = 0; i < count; ++i) {
+        unsigned int const v = nibble(i);
+        if (high < 0) {
+            high = static_cast<int>(v);
+        } else {
+            if (char const byte = static_cast<char>(high << 4 | static_cast<int>(v)))
+                out += byte;
+            high = -1;
+        }
+    }
+    return out;
+}
+
 // The nodes of a getMap list, without the holes removals left.
 void appendListed(std::vector<Node*> const& listed, std::vector<Node*>& nodes)
 {
@@ -574,6 +652,16 @@ std::string NodeStore::walkPath(Node* node, std::vector<PendingPath>* pending) c
     if (std::string const* cached = cachedPath(node->getNodeId()))
         return *cached;
 
+    // Most nodes arrive below a registered parent, whose path is cached.
+    unsigned int const linked = node->getLinkedId();
+    if (linked != 0 && linked != node->getNodeId())
+        if (std::string const* parentPath = cachedPath(linked)) {
+            std::string path = extendPath(*parentPath, node->getSensor(), node->getInstance());
+            if (pending)
+                pending->push_back(PendingPath{node, path});
+            return path;
+        }
+
     // Up: from the node to its nearest ancestor with a cached path, or to
     // the topmost registered one, which then counts as a root.
     std::vector<Node*> chain{node};
@@ -600,14 +688,9 @@ std::string NodeStore::walkPath(Node* node, std::vector<PendingPath>* pending) c
     }
 
     // Down: each node's own pair in front of its parent's pairs.
-    TopoVec topovec;
     while (!chain.empty()) {
         Node* n = chain.back();
-        topovec.clear();
-        topovec.emplace_back(n->getSensor(), n->getInstance());
-        if (!base.empty())
-            uniqueid2topovec(base, kAllPairs, topovec);
-        base = nodecode(topovec);
+        base = extendPath(base, n->getSensor(), n->getInstance());
         if (pending)
             pending->push_back(PendingPath{n, base});
         chain.pop_back();
