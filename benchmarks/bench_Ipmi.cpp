@@ -12,6 +12,10 @@
 
 #include <benchmark/benchmark.h>
 
+#include <arpa/inet.h>
+#include <netinet/in.h>
+#include <poll.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -20,7 +24,9 @@
 #include <filesystem>
 #include <fstream>
 #include <atomic>
+#include <chrono>
 #include <map>
+#include <queue>
 #include <memory>
 #include <string>
 #include <thread>
@@ -34,12 +40,149 @@ std::string const kState = "/tmp/ic_bench_ipmi";
 unsigned int const kLan = 20000 + static_cast<unsigned int>(::getpid() % 1000) * 20;
 constexpr int kSimulators = 8;
 
-ipmi::BmcConfig config(int simulator = 0)
+// A network between the readers and the simulators: every datagram reaches
+// the other side `delay` after it was sent, as on a LAN to a real BMC whose
+// firmware takes its time. On loopback a simulator answers at once, so a
+// poll is all CPU and there is no waiting for threads to overlap. Simulator
+// k is reached through 127.0.0.1:port(k); each client address gets its own
+// socket towards the simulator, so that answers find their way back.
+class DelayLine {
+public:
+    DelayLine(std::chrono::microseconds delay, int simulators) : delay_(delay)
+    {
+        for (int k = 0; k < simulators; ++k) {
+            int const fd = udpSocket(0);
+            sockaddr_in a{};
+            socklen_t len = sizeof a;
+            ::getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len);
+            fronts_.push_back(Front{fd, ntohs(a.sin_port), address(kLan + 2 * static_cast<unsigned int>(k))});
+        }
+        thread_ = std::thread([this] { run(); });
+    }
+    ~DelayLine()
+    {
+        stop_ = true;
+        thread_.join();
+        for (Front const& f : fronts_)
+            ::close(f.fd);
+        for (auto const& [fd, back] : backs_)
+            ::close(fd);
+    }
+    unsigned int port(int k) const { return fronts_[static_cast<std::size_t>(k)].port; }
+
+private:
+    using Clock = std::chrono::steady_clock;
+    struct Front {
+        int fd;
+        unsigned int port;
+        sockaddr_in simulator;
+    };
+    struct Back {
+        std::size_t front;
+        sockaddr_in client;
+        Clock::time_point used;
+    };
+    struct Datagram {
+        Clock::time_point due;
+        int fd;
+        sockaddr_in to;
+        std::string bytes;
+        bool operator<(Datagram const& o) const { return due > o.due; }
+    };
+
+    static sockaddr_in address(unsigned int port)
+    {
+        sockaddr_in a{};
+        a.sin_family = AF_INET;
+        a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        a.sin_port = htons(static_cast<uint16_t>(port));
+        return a;
+    }
+    static int udpSocket(unsigned int port)
+    {
+        int const fd = ::socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+        sockaddr_in const a = address(port);
+        ::bind(fd, reinterpret_cast<sockaddr const*>(&a), sizeof a);
+        return fd;
+    }
+
+    // The socket towards front's simulator for this client, made at first use.
+    int backFor(std::size_t front, sockaddr_in const& client)
+    {
+        for (auto& [fd, back] : backs_)
+            if (back.front == front && back.client.sin_port == client.sin_port) {
+                back.used = Clock::now();
+                return fd;
+            }
+        int const fd = udpSocket(0);
+        backs_[fd] = Back{front, client, Clock::now()};
+        return fd;
+    }
+
+    void run()
+    {
+        std::priority_queue<Datagram> queue;
+        char buffer[2048];
+        while (!stop_) {
+            Clock::time_point const now = Clock::now();
+            while (!queue.empty() && queue.top().due <= now) {
+                Datagram const& d = queue.top();
+                ::sendto(d.fd, d.bytes.data(), d.bytes.size(), 0, reinterpret_cast<sockaddr const*>(&d.to), sizeof d.to);
+                queue.pop();
+            }
+            // A session's client socket is gone after its poll: forget it.
+            for (auto it = backs_.begin(); it != backs_.end();)
+                if (now - it->second.used > std::chrono::seconds(2)) {
+                    ::close(it->first);
+                    it = backs_.erase(it);
+                } else {
+                    ++it;
+                }
+            std::vector<pollfd> fds;
+            for (Front const& f : fronts_)
+                fds.push_back(pollfd{f.fd, POLLIN, 0});
+            for (auto const& [fd, back] : backs_)
+                fds.push_back(pollfd{fd, POLLIN, 0});
+            auto const wait = queue.empty() ? std::chrono::nanoseconds(std::chrono::milliseconds(10))
+                                            : std::max(Clock::duration::zero(), queue.top().due - Clock::now());
+            timespec const ts{0, static_cast<long>(std::chrono::duration_cast<std::chrono::nanoseconds>(wait).count())};
+            if (::ppoll(fds.data(), fds.size(), &ts, nullptr) <= 0)
+                continue;
+            for (pollfd const& p : fds) {
+                if (!(p.revents & POLLIN))
+                    continue;
+                sockaddr_in from{};
+                socklen_t len = sizeof from;
+                ssize_t const n = ::recvfrom(p.fd, buffer, sizeof buffer, 0, reinterpret_cast<sockaddr*>(&from), &len);
+                if (n <= 0)
+                    continue;
+                Clock::time_point const due = Clock::now() + delay_;
+                std::string bytes(buffer, static_cast<std::size_t>(n));
+                auto const back = backs_.find(p.fd);
+                if (back != backs_.end()) { // an answer: back to the client
+                    queue.push(Datagram{due, fronts_[back->second.front].fd, back->second.client, std::move(bytes)});
+                    continue;
+                }
+                for (std::size_t k = 0; k < fronts_.size(); ++k)
+                    if (fronts_[k].fd == p.fd)
+                        queue.push(Datagram{due, backFor(k, from), fronts_[k].simulator, std::move(bytes)});
+            }
+        }
+    }
+
+    std::chrono::microseconds const delay_;
+    std::vector<Front> fronts_;
+    std::map<int, Back> backs_;
+    std::atomic<bool> stop_{false};
+    std::thread thread_;
+};
+
+ipmi::BmcConfig config(int simulator = 0, DelayLine const* line = nullptr)
 {
     ipmi::BmcConfig c;
     c.name = "bench";
     c.host = "127.0.0.1";
-    c.port = kLan + 2 * simulator;
+    c.port = line ? line->port(simulator) : kLan + 2 * simulator;
     c.user = "monitor";
     c.password = "icbmc-secret";
     c.workarounds = IPMI_MONITORING_WORKAROUND_FLAGS_PROTOCOL_VERSION_2_0_OPEN_SESSION_PRIVILEGE;
@@ -114,13 +257,18 @@ void BM_IpmiSensorsProcess(benchmark::State& state)
 }
 
 // One poll (sensors and the SEL check) of N simulated BMCs as the plug-in
-// makes it, steady state: a thread per BMC, each with its own reader.
+// makes it, steady state: a thread per BMC, each with its own reader. The
+// second argument delays every datagram by that many microseconds.
 void BM_PollBmcsInParallel(benchmark::State& state)
 {
     int const n = static_cast<int>(state.range(0));
+    std::unique_ptr<DelayLine> line;
+    if (state.range(1) > 0)
+        line = std::make_unique<DelayLine>(std::chrono::microseconds(state.range(1)), n);
     std::vector<std::unique_ptr<ipmi::BmcReader>> readers;
     for (int k = 0; k < n; ++k)
-        readers.push_back(std::make_unique<ipmi::BmcReader>(config(k), kState + "/parallel" + std::to_string(k)));
+        readers.push_back(std::make_unique<ipmi::BmcReader>(config(k, line.get()),
+                                                            kState + "/parallel" + std::to_string(k)));
     std::atomic<int> failed{0};
     auto const poll = [&](ipmi::BmcReader& r) {
         std::vector<ipmi::Sensor> sensors;
@@ -201,7 +349,10 @@ BENCHMARK(BM_PluginPoll)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_PluginPollWithSelCheck)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_MinimalLibipmimonitoringLoop)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_IpmiSensorsProcess)->Unit(benchmark::kMillisecond);
-BENCHMARK(BM_PollBmcsInParallel)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
+BENCHMARK(BM_PollBmcsInParallel)
+    ->ArgsProduct({{1, kSimulators}, {0, 500}})
+    ->ArgNames({"bmcs", "delay_us"})
+    ->Unit(benchmark::kMillisecond)->UseRealTime();
 BENCHMARK(BM_PluginOpenWithBmcs)->Arg(1)->Arg(kSimulators)->Unit(benchmark::kMillisecond)->UseRealTime();
 
 } // namespace
