@@ -62,6 +62,7 @@ TEST_F(Lifecycle, OpenUnloadAndOpenAgain)
     IC::ICforFP const& s = *seen("fp_one").services;
     EXPECT_TRUE(s.getMIs() == IST::mymis && IST::mymis.size() == 3u && s.getInstrumentationControl() == control_);
     EXPECT_TRUE(s.getInterfaceVersion() == IC::Number(IC::Version2{1, 0}) && s.getModuleVersion() == s.getInterfaceVersion());
+    EXPECT_TRUE(s.getRegFPAlerts() == &IST::regFPAlerts && s.getDeRegFPAlerts() == &IST::deRegFPAlerts);
 
     IC::InstrumentationControl* const ic = control_;
     IC::Error* const firstError = error_;
