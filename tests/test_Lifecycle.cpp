@@ -149,6 +149,9 @@ int unloadBeforeAnyOpen()
     Unloadlib();
     if (cap.count(kLogIC, 3000, "InstrumentationControl unload done") != 1 || !IST::unloaddone || IST::ICloadCount != 0)
         return 12;
+    IST::TimedReload(); // after the last unload, as before the first open
+    if (ictest::isMapped(tree.root()))
+        return 14;
     IC::InstrumentationControl* c = nullptr;
     IC::Error* e = nullptr;
     if (Open(&c, &e) != 0 || IST::ICloadCount != 1 || IST::unloaddone || IST::mymis.size() != 1)
