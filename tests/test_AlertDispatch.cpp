@@ -141,6 +141,8 @@ TEST_F(Dispatch, OnlyPlugInRegistrationsSeeManagementBatchesAndEachRegisterIsCal
     EXPECT_EQ(cap.count(kLogger + ".AlertStore", 4000, "newAlerts: Abnormal Status 2path =" + hex(P0)), 7u)
         << "recorded once per call, as a warning";
     EXPECT_EQ(asserted(), (Strings{fan, s, f})); // by path
+    ICC::AlertCallBackFP({alert(0, {"\x90"}, "high")});
+    EXPECT_EQ(asserted().back(), "3/0/2/high/" + hex("\x90") + ",") << "paths compare as unsigned bytes";
 }
 
 TEST_F(Dispatch, RemovalUnlistsBeforeCallbacksErasesAfterThemAndRegistersKeepThePath)

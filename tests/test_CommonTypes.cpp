@@ -63,6 +63,14 @@ TEST(CommonTypes, NodesKeepTheirIdentityAndOrderedPropertiesAndCopyBoth)
     std::string const before = "20 3 131077 131073 12 fan 3 1f5c 616263 reading=42C label=Package id 0";
     EXPECT_EQ((Strings{fields(copy), fields(assigned), fields(n)}),
               (Strings{before, before, "20 9 2 1 12 renamed 1f5c 616263 label=Package id 0"}));
+    // A poller updates properties while clients read them: the thread
+    // checker's run sees a missing lock here.
+    ictest::JoinedThread reader([&copy] {
+        for (int i = 0; i < 500; ++i)
+            copy.getProperties();
+    });
+    for (int i = 0; i < 500; ++i)
+        copy.setProperty("reading", std::to_string(i), "C");
 }
 
 } // namespace

@@ -62,6 +62,7 @@ TEST_F(Lifecycle, OpenUnloadAndOpenAgain)
     IC::ICforFP const& s = *seen("fp_one").services;
     EXPECT_TRUE(s.getMIs() == IST::mymis && IST::mymis.size() == 3u && s.getInstrumentationControl() == control_);
     EXPECT_TRUE(s.getInterfaceVersion() == IC::Number(IC::Version2{1, 0}) && s.getModuleVersion() == s.getInterfaceVersion());
+    EXPECT_TRUE(s.getRegFPAlerts() == &IST::regFPAlerts && s.getDeRegFPAlerts() == &IST::deRegFPAlerts);
 
     IC::InstrumentationControl* const ic = control_;
     IC::Error* const firstError = error_;
@@ -148,6 +149,9 @@ int unloadBeforeAnyOpen()
     Unloadlib();
     if (cap.count(kLogIC, 3000, "InstrumentationControl unload done") != 1 || !IST::unloaddone || IST::ICloadCount != 0)
         return 12;
+    IST::TimedReload(); // after the last unload, as before the first open
+    if (ictest::isMapped(tree.root()))
+        return 14;
     IC::InstrumentationControl* c = nullptr;
     IC::Error* e = nullptr;
     if (Open(&c, &e) != 0 || IST::ICloadCount != 1 || IST::unloaddone || IST::mymis.size() != 1)

@@ -95,6 +95,8 @@ TEST_F(InstalledLoader, AnUnloadDuringASlowReloadWaitsForItAndFinishes)
 {
     ictest::LogCapture cap;
     openWithLoader(1);
+    // Added after the first reload: a later one, a period on, finds it.
+    ASSERT_TRUE(ictest::eventually([&] { return cap.count(kLogIC, 3000, "Instrumentation Control Timed Reload") >= 1; }));
     tree_.addMI("mi_slow");
     ASSERT_TRUE(ictest::eventually([&] { return ictest::calls(cap, "mi_slow").size() >= 3; }, 10000));
     Unloadlib();
