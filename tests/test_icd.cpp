@@ -150,6 +150,7 @@ TEST_F(IcdTest, RequestsGetTheirAnswers)
           "description=\"CPU 0 Package id 0 temperature\",unit=\"celsius\"} ",
           "ic_sensor_threshold{path=\"" + kTemp + "\",", "kind=\"upper_critical\"} 100\n",
           "ic_node_state{path=\"" + kTemp + "\",", "ic_node_info{path=\"1f201f5c\",",
+          "description=\"Network port eno2 (b4:96:91:4a:10:02)\"} 0\n", // no link: unused, no fault
           "ic_node_info{path=\"1f5c\",type=\"59\",type_name=\"ROOT\",node_instance=\"0\","
           "description=\"Linux host rack\\\"7\\\\x1b\",parent=\"\"} 1\n", "vendor=\"Acme Computers\"",
           "ic_plugins_loaded{kind=\"mi\"} 1\n", "ic_plugins_loaded{kind=\"fp\"} 1\n",

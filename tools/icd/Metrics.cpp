@@ -43,9 +43,11 @@ char const* const kThresholds[] = {"lower_critical", "lower_warning", "upper_war
 
 int stateValue(std::string const& state)
 {
-    if (state == "ok")
+    // An unused port is no fault: nothing is asserted for it, so an alert
+    // rule on 1 must not fire for it.
+    if (state == "ok" || state == "no link")
         return 0;
-    if (state == "warning" || state == "no link")
+    if (state == "warning")
         return 1;
     if (state == "critical" || state == "offline" || state == "absent")
         return 2;

@@ -52,8 +52,8 @@ function el(tag, cls, text) {
 }
 function stateClass(s) {
   if (s === null || s === undefined) return "";
-  if (s === "ok") return "state-ok";
-  if (s === "warning" || s === "no link") return "state-warning";
+  if (s === "ok" || s === "no link") return "state-ok";
+  if (s === "warning") return "state-warning";
   if (s === "critical" || s === "offline" || s === "absent") return "state-critical";
   return "state-unknown";
 }
