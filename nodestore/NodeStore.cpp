@@ -50,29 +50,57 @@ Error const& notFound()
     return e;
 }
 
+// Writes a path's nibbles (a=0 .. p=15) packed two to a byte. A zero byte
+// is never written, and a final odd nibble, always a pair's closing 0, is
+// left out.
+class PathPacker {
+public:
+    explicit PathPacker(std::string& out) : out_(out) {}
+
+    void put(unsigned int nibble)
+    {
+        if (high_ < 0) {
+            high_ = static_cast<int>(nibble);
+            return;
+        }
+        if (char const byte = static_cast<char>(high_ << 4 | static_cast<int>(nibble)))
+            out_ += byte;
+        high_ = -1;
+    }
+    // A pair: the instance's base-12 digits, 15, the type's digits, 0.
+    void putPair(unsigned int type, unsigned int instance)
+    {
+        putNumber(instance);
+        put(15);
+        putNumber(type);
+        put(0);
+    }
+    // True when what follows starts a byte of its own.
+    bool aligned() const { return high_ < 0; }
+
+private:
+    void putNumber(unsigned int n)
+    {
+        unsigned char digits[12];
+        std::size_t count = 0;
+        do {
+            digits[count++] = static_cast<unsigned char>(1 + n % 12);
+            n /= 12;
+        } while (n != 0);
+        while (count != 0)
+            put(digits[--count]);
+    }
+
+    std::string& out_;
+    int high_ = -1;
+};
+
 // The path of a node below a parent whose path is known: the node's own
-// pair (instance digits, 15, type digits, 0) in front of the parent's
-// pairs, packed two nibbles to a byte with a final odd nibble dropped.
-// These are the bytes nodecode gives for the node's pair followed by the
-// parent's pairs as uniqueid2topovec reads them (up to and including the
-// first invalid one), without decoding and encoding the parent again.
+// pair in front of the parent's pairs as uniqueid2topovec reads them (up
+// to and including the first invalid one). These are the bytes nodecode
+// gives, without decoding the parent's path and encoding it again.
 std::string extendPath(std::string const& parent, unsigned int type, unsigned int instance)
 {
-    unsigned char own[20]; // 9 base-12 digits hold any 32-bit number
-    std::size_t n = 0;
-    auto const number = [&own, &n](unsigned int v) {
-        std::size_t const first = n;
-        do {
-            own[n++] = static_cast<unsigned char>(1 + v % 12);
-            v /= 12;
-        } while (v != 0);
-        std::reverse(own + first, own + n);
-    };
-    number(instance);
-    own[n++] = 15;
-    number(type);
-    own[n++] = 0;
-
     // The parent's nibbles: its bytes', and the closing 0 its packing
     // dropped when its last nibble is a digit. Only its first pair counts
     // when that pair is invalid (the parent's own type); a cached path has
@@ -98,33 +126,13 @@ std::string extendPath(std::string const& parent, unsigned int type, unsigned in
     }
 
     std::string out;
-    out.reserve(n / 2 + parent.size() + 1);
-    for (std::size_t i = 0; i + 1 < n; i += 2)
-        out += static_cast<char>(own[i] << 4 | own[i + 1]);
-    if (count == whole) {
-        if (n % 2 == 0)
-            return out += parent;
-        // Out of step by a nibble: the parent's nibbles shift across its bytes.
-        unsigned int high = own[n - 1];
-        for (unsigned char c : parent) {
-            out += static_cast<char>(high << 4 | c >> 4);
-            high = c & 15u;
-        }
-        if (high != 0) // the dropped closing 0 completes the last byte
-            out += static_cast<char>(high << 4);
-        return out;
-    }
-    int high = n % 2 ? own[n - 1] : -1;
-    for (std::size_t i = 0; i < count; ++i) {
-        unsigned int const v = nibble(i);
-        if (high < 0) {
-            high = static_cast<int>(v);
-        } else {
-            if (char const byte = static_cast<char>(high << 4 | static_cast<int>(v)))
-                out += byte;
-            high = -1;
-        }
-    }
+    out.reserve(12 + parent.size());
+    PathPacker packer(out);
+    packer.putPair(type, instance);
+    if (count == whole && packer.aligned())
+        return out += parent; // in step: the parent's bytes as they are
+    for (std::size_t i = 0; i < count; ++i)
+        packer.put(nibble(i));
     return out;
 }
 
@@ -891,36 +899,11 @@ std::string NodeStore::nodecode(TopoVec topovec) const
         NS_LOG(6000, "nodecode: Damaged node string ='", "", "'");
         throw std::invalid_argument("Damaged node string");
     }
-    // The letters go straight to nibbles (a=0 .. p=15), packed two to a
-    // byte; a final odd nibble, always the closing "a", is dropped.
     std::string out;
     out.reserve(topovec.size() * 3);
-    int high = -1;
-    auto const put = [&out, &high](unsigned int nibble) {
-        if (high < 0) {
-            high = static_cast<int>(nibble);
-            return;
-        }
-        if (char const byte = static_cast<char>(high << 4 | static_cast<int>(nibble)))
-            out += byte;
-        high = -1;
-    };
-    auto const putNumber = [&put](unsigned int n) {
-        unsigned char digits[12];
-        std::size_t count = 0;
-        do {
-            digits[count++] = static_cast<unsigned char>(1 + n % 12);
-            n /= 12;
-        } while (n != 0);
-        while (count != 0)
-            put(digits[--count]);
-    };
-    for (auto const& pair : topovec) {
-        putNumber(pair.second);
-        put(15);
-        putNumber(pair.first);
-        put(0);
-    }
+    PathPacker packer(out);
+    for (auto const& pair : topovec)
+        packer.putPair(pair.first, pair.second);
     return out;
 }
 
