@@ -5,6 +5,22 @@
 
 namespace icd {
 
+void signalEventFd(int fd)
+{
+    std::uint64_t const one = 1;
+    if (fd >= 0 && ::write(fd, &one, sizeof one) < 0) {
+        // EAGAIN only: the counter is full, a wake-up is pending.
+    }
+}
+
+void drainEventFd(int fd)
+{
+    std::uint64_t pending;
+    if (::read(fd, &pending, sizeof pending) < 0) {
+        // EAGAIN: another pass took them already.
+    }
+}
+
 void appendEventText(std::string& out, std::vector<Event> const& events, std::uint64_t missed)
 {
     if (missed != 0)
@@ -29,14 +45,6 @@ EventRing::~EventRing()
         ::close(wake_);
 }
 
-void EventRing::wake() const
-{
-    std::uint64_t const one = 1;
-    if (wake_ >= 0 && ::write(wake_, &one, sizeof one) < 0) {
-        // Full counter (EAGAIN): the reader has a wake-up pending anyway.
-    }
-}
-
 std::uint64_t EventRing::push(std::string data)
 {
     std::uint64_t id;
@@ -48,7 +56,7 @@ std::uint64_t EventRing::push(std::string data)
         events_.push_back(Event{id, std::make_shared<std::string const>(std::move(data))});
     }
     arrived_.notify_all();
-    wake();
+    signalEventFd(wake_);
     return id;
 }
 
@@ -90,7 +98,7 @@ void EventRing::close()
         closed_ = true;
     }
     arrived_.notify_all();
-    wake();
+    signalEventFd(wake_);
 }
 
 std::uint64_t EventRing::lastId() const

@@ -19,6 +19,12 @@ struct Event {
     std::shared_ptr<std::string const> data; // one JSON line, shared by every reader
 };
 
+// Wakes whoever waits on the eventfd fd (when fd >= 0); a full counter
+// means a wake-up is pending anyway.
+void signalEventFd(int fd);
+// Takes the wake-ups pending on the eventfd fd.
+void drainEventFd(int fd);
+
 // The event-stream text of these events, preceded by a comment when `missed`
 // earlier ones were dropped.
 void appendEventText(std::string& out, std::vector<Event> const& events, std::uint64_t missed);
@@ -54,7 +60,6 @@ public:
 
 private:
     bool collectLocked(std::uint64_t after, std::vector<Event>& out, std::uint64_t* missed) const;
-    void wake() const;
 
     std::size_t const capacity_;
     int const wake_;

@@ -90,10 +90,10 @@ EventStreams::EventStreams(EventRing& ring, std::chrono::milliseconds keepAlive,
     bool ok = epoll_ >= 0 && control_ >= 0 && epoll_ctl(epoll_, EPOLL_CTL_ADD, control_, &ev) == 0;
     ev.data.ptr = &ringTag;
     ok = ok && ring_.wakeFd() >= 0 && epoll_ctl(epoll_, EPOLL_CTL_ADD, ring_.wakeFd(), &ev) == 0;
-    if (ok)
-        writer_ = std::thread([this] { run(); });
-    else
-        stopping_ = true; // serve() answers Gone; the caller falls back
+    if (!ok)
+        return; // not running(): streams keep a thread each
+    writer_ = std::thread([this] { run(); });
+    running_ = true;
 }
 
 EventStreams::~EventStreams()
@@ -111,10 +111,7 @@ void EventStreams::stop()
         std::lock_guard<std::mutex> g(lock_);
         stopping_ = true;
     }
-    std::uint64_t const one = 1;
-    if (control_ >= 0 && ::write(control_, &one, sizeof one) < 0) {
-        // EAGAIN only: a wake-up is pending.
-    }
+    signalEventFd(control_);
     if (writer_.joinable())
         writer_.join();
 }
@@ -140,10 +137,7 @@ EventStreams::Outcome EventStreams::serve(int fd, std::uint64_t after)
         }
         incoming_.push_back(std::move(s));
     }
-    std::uint64_t const one = 1;
-    if (::write(control_, &one, sizeof one) < 0) {
-        // EAGAIN only: a wake-up is pending.
-    }
+    signalEventFd(control_);
     return done.get();
 }
 
@@ -265,17 +259,12 @@ void EventStreams::run()
             std::lock_guard<std::mutex> g(lock_);
             stopping = stopping_;
         }
-        std::uint64_t drained;
         for (int i = 0; i < n; ++i) {
             void* const tag = ready[static_cast<std::size_t>(i)].data.ptr;
             if (tag == &controlTag) {
-                if (::read(control_, &drained, sizeof drained) < 0) {
-                    // EAGAIN: another pass already took it.
-                }
+                drainEventFd(control_);
             } else if (tag == &ringTag) {
-                if (::read(ring_.wakeFd(), &drained, sizeof drained) < 0) {
-                    // The same.
-                }
+                drainEventFd(ring_.wakeFd());
             } else {
                 auto* s = static_cast<Subscriber*>(tag);
                 std::uint32_t const what = ready[static_cast<std::size_t>(i)].events;

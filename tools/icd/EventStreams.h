@@ -42,6 +42,10 @@ public:
     // Ends every stream (Closed) and the writer; serve returns at once after.
     void stop();
 
+    // False when the writer could not start (no epoll or eventfd): serve
+    // must not be called then.
+    bool running() const { return running_; }
+
 private:
     struct Subscriber {
         int fd;
@@ -70,6 +74,7 @@ private:
     std::mutex lock_;  // guards incoming_ and stopping_
     std::vector<std::unique_ptr<Subscriber>> incoming_;
     bool stopping_ = false;
+    bool running_ = false; // set once, before any stream is served
     std::list<std::unique_ptr<Subscriber>> active_; // the writer's own
     std::thread writer_;
 };

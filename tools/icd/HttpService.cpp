@@ -314,8 +314,9 @@ void HttpService::events(httplib::Request const& req, httplib::Response& res)
     res.set_header("Cache-Control", "no-cache");
     res.set_header("X-Accel-Buffering", "no");
     // A plain connection's socket goes to the one writer; TLS has to write
-    // through the connection's own session, so it keeps its thread.
-    int const fd = req.ssl ? -1
+    // through the connection's own session, so it keeps its thread, as does
+    // every stream when the writer could not start.
+    int const fd = req.ssl || !streams_->running() ? -1
                            : connectionSocket(req.local_addr, req.local_port, req.remote_addr,
                                               req.remote_port);
     auto next = std::make_shared<std::uint64_t>(after);
