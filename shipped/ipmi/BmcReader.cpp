@@ -342,10 +342,6 @@ bool fields(ipmi_ctx_t ctx, fiid_template_t tmpl, Command command,
     return ok;
 }
 
-} // namespace
-
-namespace {
-
 // The text of a FRU field, without the padding FRUs often carry and with
 // control characters (a BMC's data is not trusted) shown as '?'; "" when it
 // is empty or cannot be read.
