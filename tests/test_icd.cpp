@@ -10,6 +10,7 @@
 #include <fcntl.h>
 #include <spawn.h>
 #include <sys/socket.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -60,6 +61,7 @@ public:
         return WIFEXITED(status_) ? WEXITSTATUS(status_) : 128 + WTERMSIG(status_);
     }
     int port() const { return port_; }
+    void signal(int sig) const { kill(pid_, sig); }
     std::string output() const { return ictest::slurp(log_); }
     httplib::Client client() const
     {
@@ -290,8 +292,17 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
         crypt_r("s3cret", crypt_gensalt_rn("$2b$", 5, nullptr, 0, data.setting, sizeof data.setting), &data);
     std::string const config = dir_->write("web.yml", "basic_auth_users:\n  prom: " + hash + "\n");
 
+    // Also run as systemd runs a notify-type service: told where to say so.
+    int const notify = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    sockaddr_un where{};
+    where.sun_family = AF_UNIX;
+    std::string const notifyPath = dir_->path("notify");
+    notifyPath.copy(where.sun_path, sizeof where.sun_path - 1);
+    ASSERT_EQ(bind(notify, reinterpret_cast<sockaddr*>(&where), sizeof where), 0);
+    setenv("NOTIFY_SOCKET", notifyPath.c_str(), 1);
     Icd guarded(args({"--listen", "127.0.0.1:0", "--web-config", config, "--reload-interval", "0"}),
                 dir_->path("guarded.log"));
+    unsetenv("NOTIFY_SOCKET");
     ASSERT_NE(guarded.port(), 0) << guarded.output();
     struct Case { std::string user, password; int status; } const cases[] = {
         {"", "", 401}, {"prom", "wrong", 401}, {"other", "s3cret", 401}, {"prom", "s3cret", 200}};
@@ -303,7 +314,19 @@ TEST_F(IcdTest, RefusesUnprotectedNetworksAndChecksPasswords)
         ASSERT_TRUE(res);
         EXPECT_EQ(res->status, c.status) << c.user << ":" << c.password;
     }
+    guarded.signal(SIGHUP);
+    ictest::eventually([&] { return guarded.output().find("SIGHUP") != std::string::npos; }, 10000);
     EXPECT_EQ(guarded.stop(), 0) << guarded.output();
+    std::string told;
+    char notice[256];
+    for (ssize_t n; (n = recv(notify, notice, sizeof notice, MSG_DONTWAIT)) > 0;)
+        told += std::string(notice, static_cast<std::size_t>(n)) + " ";
+    close(notify);
+#ifdef ICD_SYSTEMD
+    EXPECT_EQ(told, "READY=1 RELOADING=1 READY=1 STOPPING=1 ");
+#else
+    EXPECT_EQ(told, "") << "built without libsystemd, icd tells nobody";
+#endif
 }
 
 } // namespace
